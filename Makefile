@@ -1,0 +1,49 @@
+# The two commands of the README: `make run` and `make test`.
+# Build folders: build/ (plain), build-asan/ (AddressSanitizer + UBSan),
+# build-tsan/ (ThreadSanitizer, for the queue and transport tests).
+
+JOBS ?= $(shell nproc)
+CMAKE_FLAGS ?=
+RUN_ARGS ?= -v
+export ASAN_OPTIONS ?= detect_leaks=1:abort_on_error=1:strict_string_checks=1
+export UBSAN_OPTIONS ?= print_stacktrace=1:halt_on_error=1
+export TSAN_OPTIONS ?= halt_on_error=1:second_deadlock_stack=1
+
+.PHONY: all deps build run test test-plain test-asan test-tsan bench clean
+
+all: build
+
+deps:
+	@scripts/install-deps
+
+build/Makefile: CMakeLists.txt
+	cmake -S . -B build $(CMAKE_FLAGS)
+
+build: deps
+	@cmake -S . -B build $(CMAKE_FLAGS) >/dev/null
+	cmake --build build -j $(JOBS)
+
+# Starts the daemon in the foreground on the bundled example applications,
+# its log on standard error.
+run: build
+	scripts/run-examples $(RUN_ARGS)
+
+test: build
+	cd build && ctest --output-on-failure -j $(JOBS)
+	$(MAKE) test-asan test-tsan
+
+test-asan: deps
+	@cmake -S . -B build-asan -DQM_SANITIZE=address $(CMAKE_FLAGS) >/dev/null
+	cmake --build build-asan -j $(JOBS)
+	cd build-asan && ctest --output-on-failure -j $(JOBS)
+
+test-tsan: deps
+	@cmake -S . -B build-tsan -DQM_SANITIZE=thread $(CMAKE_FLAGS) >/dev/null
+	cmake --build build-tsan -j $(JOBS)
+	cd build-tsan && ctest --output-on-failure -j $(JOBS) -L 'queue|transport'
+
+bench: build
+	build/bench/qmd_bench
+
+clean:
+	rm -rf build build-asan build-tsan

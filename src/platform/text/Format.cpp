@@ -1,0 +1,157 @@
+#include "platform/text/Format.h"
+
+#include <cinttypes>
+#include <cstdio>
+
+namespace qm {
+
+namespace {
+
+struct Spec {
+    std::string flags;   // flags, width and precision as written
+    std::string length;  // hh h l ll z j t L q
+    char conversion = 0;
+};
+
+bool isFlagOrWidth(char c) {
+    return c == '-' || c == '+' || c == ' ' || c == '#' || c == '0' || (c >= '1' && c <= '9') || c == '.';
+}
+
+bool isLength(char c) {
+    return c == 'h' || c == 'l' || c == 'z' || c == 'j' || c == 't' || c == 'L' || c == 'q';
+}
+
+std::string printfOne(const std::string& spec, auto value) {
+    char buffer[128];
+    int n = std::snprintf(buffer, sizeof buffer, spec.c_str(), value);
+    if (n < 0) {
+        return {};
+    }
+    if (static_cast<std::size_t>(n) < sizeof buffer) {
+        return std::string(buffer, static_cast<std::size_t>(n));
+    }
+    std::string big(static_cast<std::size_t>(n) + 1, '\0');
+    std::snprintf(big.data(), big.size(), spec.c_str(), value);
+    big.resize(static_cast<std::size_t>(n));
+    return big;
+}
+
+std::int64_t signedValue(const FormatArg& arg) {
+    return arg.kind == FormatArg::Kind::Signed ? arg.i : static_cast<std::int64_t>(arg.u);
+}
+
+std::uint64_t unsignedValue(const FormatArg& arg) {
+    return arg.kind == FormatArg::Kind::Signed ? static_cast<std::uint64_t>(arg.i) : arg.u;
+}
+
+bool isInteger(const FormatArg& arg) {
+    return arg.kind == FormatArg::Kind::Signed || arg.kind == FormatArg::Kind::Unsigned ||
+           arg.kind == FormatArg::Kind::Pointer;
+}
+
+std::string textOf(const FormatArg& arg) {
+    switch (arg.kind) {
+        case FormatArg::Kind::Text: return arg.text;
+        case FormatArg::Kind::NullText: return "(null)";
+        case FormatArg::Kind::Signed: return std::to_string(arg.i);
+        case FormatArg::Kind::Unsigned: return std::to_string(arg.u);
+        case FormatArg::Kind::Double: return printfOne("%g", arg.d);
+        case FormatArg::Kind::Pointer: return printfOne("%p", reinterpret_cast<void*>(arg.u));
+    }
+    return {};
+}
+
+std::string convert(const Spec& spec, const FormatArg& arg) {
+    const bool wide = !spec.length.empty() && spec.length != "h" && spec.length != "hh";
+    std::string base = "%" + spec.flags;
+    switch (spec.conversion) {
+        case '@':
+        case 's': {
+            std::string text = textOf(arg);
+            return spec.flags.empty() ? text : printfOne(base + "s", text.c_str());
+        }
+        case 'd':
+        case 'i':
+            if (!isInteger(arg)) {
+                return textOf(arg);
+            }
+            if (wide) {
+                return printfOne(base + PRId64, signedValue(arg));
+            }
+            return printfOne(base + "d", static_cast<std::int32_t>(static_cast<std::uint32_t>(unsignedValue(arg))));
+        case 'u':
+        case 'x':
+        case 'X':
+        case 'o':
+            if (!isInteger(arg)) {
+                return textOf(arg);
+            }
+            if (wide) {
+                const char* c = spec.conversion == 'u'   ? PRIu64
+                                : spec.conversion == 'x' ? PRIx64
+                                : spec.conversion == 'X' ? PRIX64
+                                                         : PRIo64;
+                return printfOne(base + c, unsignedValue(arg));
+            }
+            return printfOne(base + spec.conversion, static_cast<std::uint32_t>(unsignedValue(arg)));
+        case 'c':
+            return isInteger(arg) ? std::string(1, static_cast<char>(unsignedValue(arg))) : textOf(arg);
+        case 'p':
+            return printfOne("%p", reinterpret_cast<void*>(unsignedValue(arg)));
+        case 'f':
+        case 'F':
+        case 'g':
+        case 'G':
+        case 'e':
+        case 'E': {
+            double d = arg.kind == FormatArg::Kind::Double     ? arg.d
+                       : arg.kind == FormatArg::Kind::Signed   ? static_cast<double>(arg.i)
+                       : arg.kind == FormatArg::Kind::Unsigned ? static_cast<double>(arg.u)
+                                                               : 0.0;
+            return printfOne(base + spec.conversion, d);
+        }
+        default:
+            return textOf(arg);
+    }
+}
+
+}  // namespace
+
+std::string formatArgs(std::string_view format, const std::vector<FormatArg>& args) {
+    std::string out;
+    out.reserve(format.size() + 32);
+    std::size_t next = 0;
+    for (std::size_t i = 0; i < format.size(); ++i) {
+        char c = format[i];
+        if (c != '%') {
+            out += c;
+            continue;
+        }
+        if (i + 1 < format.size() && format[i + 1] == '%') {
+            out += '%';
+            ++i;
+            continue;
+        }
+        std::size_t j = i + 1;
+        Spec spec;
+        while (j < format.size() && isFlagOrWidth(format[j])) {
+            spec.flags += format[j++];
+        }
+        while (j < format.size() && isLength(format[j])) {
+            spec.length += format[j++];
+        }
+        if (j >= format.size()) {
+            out.append(format.substr(i));  // a dangling '%' prints as written
+            break;
+        }
+        spec.conversion = format[j];
+        static const FormatArg missing;
+        const FormatArg& arg = next < args.size() ? args[next] : missing;
+        ++next;
+        out += convert(spec, arg);
+        i = j;
+    }
+    return out;
+}
+
+}  // namespace qm
