@@ -1,0 +1,26 @@
+#pragma once
+// The keys of the request and reply dictionaries, and the protocol versions.
+
+#include <cstdint>
+
+namespace wire {
+
+inline constexpr const char* kRequest = "request";
+inline constexpr const char* kVersion = "version";
+inline constexpr const char* kPaths = "paths";
+inline constexpr const char* kFlags = "flags";
+inline constexpr const char* kUuids = "uuids";
+inline constexpr const char* kRules = "rules";
+inline constexpr const char* kAnnotations = "annotations";
+inline constexpr const char* kErrorCode = "errorcode";
+inline constexpr const char* kError = "error";
+inline constexpr const char* kMatches = "matches";
+inline constexpr const char* kConflicts = "conflicts";
+inline constexpr const char* kExtensions = "extensions";
+
+inline constexpr std::uint64_t kCurrentVersion = 3;
+inline constexpr std::uint64_t kOldestVersion = 2;
+
+inline constexpr const char* kDefaultServiceName = "ovaro.quamber.qmd";
+
+}  // namespace wire

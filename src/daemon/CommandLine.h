@@ -1,0 +1,19 @@
+#pragma once
+// The daemon's command line: qmd [-S servicename] [-d database-path] [-v ...],
+// parsed POSIX getopt style with the option string "d:S:v".
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+struct QMDOptions {
+    std::string serviceName = "ovaro.quamber.qmd";
+    std::optional<std::string> databasePath;
+    std::uint32_t verbosity = 0;
+};
+
+// The options, or nothing after printing the usage line on standard error
+// (the caller then exits with status 2). getopt's own diagnostic stays on.
+std::optional<QMDOptions> parseCommandLine(int argc, char** argv);
+
+inline constexpr int kUsageExitStatus = 2;

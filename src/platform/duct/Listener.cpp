@@ -1,0 +1,132 @@
+#include "platform/duct/Listener.h"
+
+#include <sys/socket.h>
+
+#include <fcntl.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "platform/env/Environment.h"
+#include "platform/log/SystemLog.h"
+
+namespace qm::duct {
+
+namespace {
+
+constexpr int kMaxAcceptsPerTurn = 64;
+
+bool isListeningStreamSocket(int fd) {
+    int accepting = 0;
+    socklen_t length = sizeof accepting;
+    int type = 0;
+    socklen_t typeLength = sizeof type;
+    return ::getsockopt(fd, SOL_SOCKET, SO_ACCEPTCONN, &accepting, &length) == 0 && accepting &&
+           ::getsockopt(fd, SOL_SOCKET, SO_TYPE, &type, &typeLength) == 0 && type == SOCK_STREAM;
+}
+
+}  // namespace
+
+Result<std::shared_ptr<Listener>> Listener::create(EventLoop& loop, const std::string& serviceName,
+                                                   SerialQueue& eventQueue) {
+    if (auto path = serviceSocketPath(serviceName); !path) {
+        return path.error();
+    }
+    auto activated = takeSocketActivationDescriptors();
+    if (!activated.empty()) {
+        UniqueFd socket(activated.front());
+        for (std::size_t i = 1; i < activated.size(); ++i) {
+            ::close(activated[i]);  // one service, one socket
+        }
+        if (!isListeningStreamSocket(socket.get())) {
+            return Error{kDuctErrorDomain, EBADF, "the socket passed by the service manager is not a listening stream socket"};
+        }
+        int flags = ::fcntl(socket.get(), F_GETFL);
+        ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK);
+        ::fcntl(socket.get(), F_SETFD, FD_CLOEXEC);
+        return std::shared_ptr<Listener>(new Listener(loop, serviceName, eventQueue, std::move(socket), UniqueFd()));
+    }
+    auto claimed = openServiceSocket(serviceName);
+    if (!claimed) {
+        return claimed.error();
+    }
+    return std::shared_ptr<Listener>(new Listener(loop, serviceName, eventQueue, std::move(claimed->listener),
+                                                  std::move(claimed->lock)));
+}
+
+Listener::Listener(EventLoop& loop, std::string serviceName, SerialQueue& eventQueue, UniqueFd socket, UniqueFd lock)
+    : loop_(loop), serviceName_(std::move(serviceName)), eventQueue_(eventQueue), socket_(std::move(socket)),
+      lock_(std::move(lock)) {}
+
+Listener::~Listener() = default;
+
+void Listener::setConnectionHandler(ConnectionHandler handler) {
+    handler_ = std::move(handler);
+}
+
+MaybeError Listener::resume() {
+    if (registered_) {
+        return std::nullopt;
+    }
+    auto id = loop_.add(socket_.get(), EPOLLIN, shared_from_this());
+    if (!id) {
+        return id.error();
+    }
+    registration_ = *id;
+    registered_ = true;
+    return std::nullopt;
+}
+
+void Listener::handleEvents(std::uint32_t events) {
+    if (events & EPOLLIN) {
+        acceptPending();
+    }
+}
+
+void Listener::acceptPending() {
+    for (int i = 0; i < kMaxAcceptsPerTurn && !paused_; ++i) {
+        UniqueFd peer(::accept4(socket_.get(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
+        if (!peer) {
+            if (errno == EMFILE || errno == ENFILE || errno == ENOBUFS || errno == ENOMEM) {
+                systemLogf(kLogNotice, "out of descriptors: not accepting connections for now (%s)", std::strerror(errno));
+                pauseAccepting();
+            }
+            return;  // EAGAIN, or a peer that gave up before we took it
+        }
+        std::weak_ptr<Listener> weakSelf = weak_from_this();
+        auto connection = PeerConnection::adopt(loop_, std::move(peer), [weakSelf] {
+            if (auto self = weakSelf.lock()) {
+                self->resumeAccepting();
+            }
+        });
+        eventQueue_.async([weakSelf, connection] {
+            if (auto self = weakSelf.lock(); self && self->handler_) {
+                self->handler_(connection);
+            }
+        });
+    }
+}
+
+void Listener::pauseAccepting() {
+    if (paused_ || !registered_) {
+        return;
+    }
+    paused_ = true;
+    (void)loop_.modify(registration_, socket_.get(), 0);
+    // Retry after a while even if no connection closes (another process may free descriptors).
+    loop_.postAfter(std::chrono::seconds(1), [weakSelf = weak_from_this()] {
+        if (auto self = weakSelf.lock()) {
+            self->resumeAccepting();
+        }
+    });
+}
+
+void Listener::resumeAccepting() {
+    if (!paused_) {
+        return;
+    }
+    paused_ = false;
+    (void)loop_.modify(registration_, socket_.get(), EPOLLIN);
+}
+
+}  // namespace qm::duct

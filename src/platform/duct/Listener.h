@@ -1,0 +1,55 @@
+#pragma once
+// The listener of a named service. Each accepted peer becomes a
+// PeerConnection, handed to the event handler on the listener's event queue.
+// Nothing is accepted before resume(): peers that connect earlier wait in the
+// socket's backlog.
+//
+// Running out of descriptors never spins: accepting pauses until a
+// connection closes, or a second has passed.
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/duct/PeerConnection.h"
+#include "platform/duct/ServiceSocket.h"
+#include "platform/queue/EventLoop.h"
+#include "platform/queue/SerialQueue.h"
+
+namespace qm::duct {
+
+class Listener final : public EventSource, public std::enable_shared_from_this<Listener> {
+public:
+    using ConnectionHandler = std::function<void(std::shared_ptr<PeerConnection>)>;
+
+    // Listens on the service's socket; with systemd socket activation, on the
+    // passed socket instead.
+    static Result<std::shared_ptr<Listener>> create(EventLoop& loop, const std::string& serviceName,
+                                                    SerialQueue& eventQueue);
+    ~Listener() override;
+
+    void setConnectionHandler(ConnectionHandler handler);  // before resume()
+    MaybeError resume();
+    const std::string& serviceName() const noexcept { return serviceName_; }
+
+    void handleEvents(std::uint32_t events) override;
+
+private:
+    Listener(EventLoop& loop, std::string serviceName, SerialQueue& eventQueue, UniqueFd socket, UniqueFd lock);
+    void acceptPending();
+    void pauseAccepting();
+    void resumeAccepting();
+
+    EventLoop& loop_;
+    const std::string serviceName_;
+    SerialQueue& eventQueue_;
+    UniqueFd socket_;
+    UniqueFd lock_;
+    ConnectionHandler handler_;
+    EventLoop::RegistrationId registration_ = 0;
+    bool registered_ = false;
+    bool paused_ = false;  // loop thread only
+};
+
+}  // namespace qm::duct

@@ -1,0 +1,101 @@
+// Requests of a client that died while they waited are never served.
+
+#include <gtest/gtest.h>
+
+#include <condition_variable>
+#include <mutex>
+#include <thread>
+
+#include "daemon/QMDServer.h"
+#include "platform/log/SystemLog.h"
+#include "support/RawClient.h"
+#include "support/TempDir.h"
+
+namespace {
+
+class CapturedLog {
+public:
+    CapturedLog() {
+        qm::setLogObserver([this](int, std::string_view line) {
+            std::lock_guard lock(mutex_);
+            text_.append(line).append("\n");
+        });
+    }
+    ~CapturedLog() { qm::setLogObserver(nullptr); }
+    std::string text() {
+        std::lock_guard lock(mutex_);
+        return text_;
+    }
+    bool waitFor(const std::string& needle) {
+        for (int i = 0; i < 500; ++i) {
+            if (text().find(needle) != std::string::npos) {
+                return true;
+            }
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        }
+        return false;
+    }
+
+private:
+    std::mutex mutex_;
+    std::string text_;
+};
+
+TEST(DeadClient, QueuedRequestsOfADeadClientGetNoHandlerAndNoReply) {
+    qmtest::TempDir dir;
+    ::setenv("QM_DUCT_DIR", dir.file("duct").c_str(), 1);
+    CapturedLog log;
+    auto server = QMDServer::initForService("dead.qmd", std::nullopt);
+    ASSERT_TRUE(server) << server.error().text();
+    (*server)->setVerbose(1);
+    std::thread loop([s = *server] { s->run(); });
+
+    // Hold mainQueue so the client's requests wait behind this job.
+    std::mutex mutex;
+    std::condition_variable changed;
+    bool blocking = false;
+    bool release = false;
+    std::thread blocker([&] {
+        (*server)->mainQueue().async([&] {
+            std::unique_lock lock(mutex);
+            blocking = true;
+            changed.notify_all();
+            changed.wait(lock, [&] { return release; });
+        });
+    });
+    {
+        std::unique_lock lock(mutex);
+        changed.wait(lock, [&] { return blocking; });
+    }
+    std::string socketPath = dir.file("duct") + "/dead.qmd";
+    {
+        qmtest::RawClient client(socketPath);
+        ASSERT_TRUE(client.connected());
+        for (int i = 0; i < 3; ++i) {
+            client.send(qmtest::request({{"request", "bulk"}, {"version", std::uint64_t{3}}}));
+        }
+    }  // hangs up with three requests queued
+    EXPECT_TRUE(log.waitFor("client " + std::to_string(::getpid()) + " is dead"));
+    {
+        std::lock_guard lock(mutex);
+        release = true;
+    }
+    changed.notify_all();
+    blocker.join();
+    // Once the queue has drained, none of the three was handled.
+    (*server)->mainQueue().sync([] {});
+    EXPECT_EQ(log.text().find("bulk options"), std::string::npos) << log.text();
+    EXPECT_EQ(log.text().find("request bulk"), std::string::npos) << log.text();
+
+    // A live client is still served afterwards.
+    qmtest::RawClient live(socketPath);
+    auto reply = live.roundTrip(qmtest::request({{"request", "bulk"}, {"version", std::uint64_t{3}}}));
+    EXPECT_TRUE(reply);
+    EXPECT_TRUE(log.waitFor("bulk options 0x0 not supported"));
+
+    (*server)->eventLoop().stop();
+    loop.join();
+    ::unsetenv("QM_DUCT_DIR");
+}
+
+}  // namespace

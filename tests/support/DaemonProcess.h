@@ -1,0 +1,65 @@
+#pragma once
+// Starts a real qmd in a private runtime directory, with its log on a file,
+// for end-to-end tests. The daemon is killed when the object goes.
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "support/TempDir.h"
+
+namespace qmtest {
+
+struct DaemonOptions {
+    std::vector<std::string> arguments;              // after the program name
+    std::map<std::string, std::string> environment;  // added to (or replacing) the test's own
+    std::string serviceName = "qmtest.qmd";
+    bool waitForSocket = true;
+};
+
+class DaemonProcess {
+public:
+    explicit DaemonProcess(DaemonOptions options = {});
+    ~DaemonProcess();
+    DaemonProcess(const DaemonProcess&) = delete;
+    DaemonProcess& operator=(const DaemonProcess&) = delete;
+
+    pid_t pid() const { return pid_; }
+    const std::string& runtimeDirectory() const { return runtimeDirectory_; }
+    std::string socketPath() const { return runtimeDirectory_ + "/" + serviceName_; }
+    const std::string& serviceName() const { return serviceName_; }
+    const TempDir& scratch() const { return scratch_; }
+
+    // What the daemon wrote to standard error so far (its log, QM_LOG_STDERR=1).
+    std::string log() const;
+    // Waits until the log holds the text; true when it does.
+    bool waitForLog(const std::string& text, std::chrono::milliseconds timeout = std::chrono::seconds(5)) const;
+    // Waits for the process to exit; its wait status, or nothing on timeout.
+    std::optional<int> waitForExit(std::chrono::milliseconds timeout);
+    bool running();
+    // Open descriptors of the daemon (entries of /proc/<pid>/fd).
+    std::size_t openDescriptorCount() const;
+
+private:
+    TempDir scratch_;
+    std::string runtimeDirectory_;
+    std::string serviceName_;
+    std::string logPath_;
+    pid_t pid_ = -1;
+    std::optional<int> status_;
+};
+
+// Runs a program to completion; exit status and captured output.
+struct ProgramResult {
+    int exitStatus = -1;  // -1 when killed by a signal
+    std::string out;
+    std::string err;
+};
+ProgramResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& environment = {},
+                         std::chrono::milliseconds timeout = std::chrono::seconds(30));
+
+}  // namespace qmtest
