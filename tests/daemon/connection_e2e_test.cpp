@@ -53,7 +53,7 @@ TEST(Connections, BrokenFramesCloseOnlyTheirOwnConnection) {
         {"reply kind from a client", frame("\xa0", 2)},
         {"unknown kind", frame("\xa0", 7)},
         {"not CBOR at all", frame("\xff\xff\xff")},
-        {"trailing bytes", frame("\xa0\x00")},
+        {"trailing bytes", frame(std::string("\xa0\x00", 2))},
         {"indefinite map", frame("\xbf\xff")},
         {"integer map key", frame("\xa1\x01\x02")},
         {"duplicate key", frame("\xa2\x61k\x01\x61k\x02")},
@@ -116,10 +116,16 @@ TEST(Connections, AFloodingClientThatNeverReadsDelaysNobodyElse) {
     }
     std::atomic<bool> stop{false};
     std::thread flood([&] {
-        // Non-blocking, so the thread ends when asked even if the daemon stops reading.
+        // Non-blocking, so the thread ends when asked even if the daemon
+        // stops reading; a partial send goes on where it stopped.
+        std::size_t offset = 0;
         while (!stop.load()) {
-            ::send(flooder.fd(), batch.data(), batch.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
-            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+            ssize_t n = ::send(flooder.fd(), batch.data() + offset, batch.size() - offset, MSG_DONTWAIT | MSG_NOSIGNAL);
+            if (n > 0) {
+                offset = (offset + static_cast<std::size_t>(n)) % batch.size();
+            } else {
+                std::this_thread::sleep_for(std::chrono::milliseconds(1));
+            }
         }
     });
     for (int i = 0; i < 20; ++i) {
@@ -168,7 +174,7 @@ TEST(Connections, FiveHundredConcurrentClientsAreServedAndLeaveNoDescriptorBehin
 }
 
 TEST(Connections, AClientThatHangsUpIsMarkedDead) {
-    DaemonProcess daemon(qmtest::DaemonOptions{{"-v"}});
+    DaemonProcess daemon(qmtest::withArguments({"-v"}));
     {
         RawClient client(daemon.socketPath());
         ASSERT_TRUE(client.roundTrip(bulk()));

@@ -126,7 +126,7 @@ TEST(Protocol, VerbosityChoosesWhatIsLogged) {
         bool fullRequests;
     };
     for (const Case& c : {Case{{}, false, false}, Case{{"-v"}, true, false}, Case{{"-v", "-v"}, true, true}}) {
-        DaemonProcess daemon(DaemonOptions{c.flags});
+        DaemonProcess daemon(qmtest::withArguments(c.flags));
         RawClient client(daemon.socketPath());
         roundTrip(client, request({{"request", "bulk"}, {"version", std::uint64_t{3}}}));
         roundTrip(client, request({{"request", "nope"}, {"version", std::uint64_t{3}}}));
@@ -143,7 +143,7 @@ TEST(Protocol, VerbosityChoosesWhatIsLogged) {
 }
 
 TEST(Protocol, EveryThousandthRequestOfAClientIsCounted) {
-    DaemonProcess daemon(DaemonOptions{{"-v"}});
+    DaemonProcess daemon(qmtest::withArguments({"-v"}));
     RawClient client(daemon.socketPath());
     std::string line = "client " + std::to_string(::getpid()) + " used ";
     for (int i = 1; i <= 2000; ++i) {

@@ -92,7 +92,9 @@ TEST(Startup, AStaleSocketFileIsReplaced) {
         std::strcpy(address.sun_path, path.c_str());
         ASSERT_EQ(::bind(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
     }  // closed without listening: nobody answers there
-    DaemonProcess daemon(DaemonOptions{{}, {{"QM_DUCT_DIR", duct}}, "stale.qmd"});
+    DaemonOptions options = qmtest::withEnvironment({{"QM_DUCT_DIR", duct}});
+    options.serviceName = "stale.qmd";
+    DaemonProcess daemon(options);
     RawClient client(path);
     EXPECT_TRUE(client.roundTrip(bulk()));
 }
@@ -128,7 +130,7 @@ TEST(Startup, ASocketPassedByTheServiceManagerIsUsed) {
 }
 
 TEST(Startup, AnIdleDaemonExitsButNotUnderAConnectedClient) {
-    DaemonProcess daemon(DaemonOptions{{}, {{"QM_IDLE_EXIT", "1"}}});
+    DaemonProcess daemon(qmtest::withEnvironment({{"QM_IDLE_EXIT", "1"}}));
     {
         RawClient client(daemon.socketPath());
         ASSERT_TRUE(client.roundTrip(bulk()));

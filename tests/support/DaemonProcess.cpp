@@ -76,6 +76,7 @@ DaemonProcess::DaemonProcess(DaemonOptions options) : serviceName_(options.servi
     for (const auto& [k, v] : options.environment) {
         env[k] = v;
     }
+    runtimeDirectory_ = env["QM_DUCT_DIR"];
     std::vector<std::string> argv = {QMD_BINARY_PATH, "-S", serviceName_};
     argv.insert(argv.end(), options.arguments.begin(), options.arguments.end());
     auto envStrings = mergedEnvironment(env);

@@ -21,6 +21,18 @@ struct DaemonOptions {
     bool waitForSocket = true;
 };
 
+inline DaemonOptions withArguments(std::vector<std::string> arguments) {
+    DaemonOptions options;
+    options.arguments = std::move(arguments);
+    return options;
+}
+
+inline DaemonOptions withEnvironment(std::map<std::string, std::string> environment) {
+    DaemonOptions options;
+    options.environment = std::move(environment);
+    return options;
+}
+
 class DaemonProcess {
 public:
     explicit DaemonProcess(DaemonOptions options = {});

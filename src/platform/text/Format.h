@@ -55,8 +55,8 @@ FormatArg makeFormatArg(const T& value) {
         const std::string* s = value.asString();
         arg.text = s ? *s : value.description();
     } else if constexpr (std::is_convertible_v<T, std::string_view>) {
-        if constexpr (std::is_pointer_v<T> || std::is_array_v<T>) {
-            if (static_cast<const char*>(value) == nullptr) {
+        if constexpr (std::is_pointer_v<T>) {
+            if (value == nullptr) {
                 arg.kind = FormatArg::Kind::NullText;
                 return arg;
             }

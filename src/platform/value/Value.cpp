@@ -326,7 +326,7 @@ void Value::appendDescription(std::string& out) const {
                            out += "; ";
                        }
                        if (!d->empty()) {
-                           out.pop_back();
+                           out.resize(out.size() - 2);  // the last "; "
                        }
                        out += '}';
                    },

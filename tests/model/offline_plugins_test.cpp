@@ -1,0 +1,226 @@
+// Plug-ins read straight from the example bundles, with the registration
+// facts taken from the disk.
+
+#include <gtest/gtest.h>
+
+#include <sys/stat.h>
+
+#include "ModelTestSupport.h"
+#include "model/OfflinePlugIns.h"
+#include "support/TempDir.h"
+
+namespace {
+
+using modeltest::at;
+using modeltest::dict;
+using modeltest::ScopedEnvironment;
+using qm::Value;
+
+const std::string kExamples = std::string(QM_SOURCE_DIR) + "/examples";
+const std::string kNotes = kExamples + "/Applications/Notes.app";
+const std::string kStudio = kExamples + "/Applications/Studio.app";
+const std::string kNotesPlugIns = kNotes + "/PlugIns/";
+const std::string kStudioPlugIns = kStudio + "/Contents/PlugIns/";
+
+class OfflineExamples : public ::testing::Test {
+protected:
+    qmtest::TempDir dir;
+    ScopedEnvironment testSdk{"QMTEST_SDK", std::nullopt};
+    ScopedEnvironment sdkPath{"QM_SDK_PATH", dir.file("no-sdks")};
+    ScopedEnvironment dataHome{"XDG_DATA_HOME", dir.file("data")};
+    ScopedEnvironment systemRoots{"QM_SYSTEM_ROOTS", std::nullopt};
+    OfflinePlugIns inspector{SdkRegistry({kExamples + "/SDKs"})};
+
+    std::vector<OfflinePlugIn> inspect(const std::string& bundle, std::optional<std::string> identifier = std::nullopt) {
+        auto result = inspector.inspectBundle(bundle, identifier);
+        EXPECT_TRUE(result.ok()) << (result.ok() ? "" : result.error().text());
+        return result.ok() ? std::move(*result) : std::vector<OfflinePlugIn>{};
+    }
+
+    OfflinePlugIn inspectOne(const std::string& bundle) {
+        auto plugIns = inspect(bundle);
+        EXPECT_EQ(plugIns.size(), 1u);
+        return plugIns.empty() ? OfflinePlugIn{} : std::move(plugIns.front());
+    }
+};
+
+TEST_F(OfflineExamples, ANewStylePlugInIsMergedWithItsSdkAndValid) {
+    OfflinePlugIn share = inspectOne(kNotesPlugIns + "ShareToNotes.bundle");
+    ASSERT_TRUE(share.plugIn);
+    EXPECT_EQ(share.error, std::nullopt);
+    const QMPlugInCore& p = *share.plugIn;
+    EXPECT_EQ(p.identifier(), "ovaro.example.notes.share");
+    EXPECT_EQ(p.protocolSpec(), Value("ShareServiceProtocol"));
+    EXPECT_EQ(at(p.plugInDictionary(), {"CleanTimeout"}), Value(30)) << "the SDK's CleanTimeout wins";
+    EXPECT_EQ(at(p.attributes(), {"Category"}), Value("notes")) << "the bundle wins elsewhere";
+    EXPECT_EQ(at(p.attributes(), {"Activation", "MaxItems"}), Value(1)) << "nested dictionaries merge";
+    EXPECT_EQ(at(p.plugInDictionary(), {"Shared"}).asArray()->size(), 3u) << "Resources, Help, Templates";
+    EXPECT_EQ(at(p.bundleInfoDictionary(), {"MRBundleSupportedPlatforms"}).isArray(), true);
+    EXPECT_EQ(p.version(), Value("3.1"));
+    EXPECT_EQ(p.hubProtocolVersion(), 2u);
+    EXPECT_EQ(p.containingPath(), kNotes);
+    EXPECT_EQ(p.localizedName(), "Share to Notes");
+    EXPECT_EQ(p.localizedShortName(), "Share");
+    EXPECT_EQ(p.localizedContainingName(), "Example Notes");
+    EXPECT_FALSE(p.onSystemVolume());
+    EXPECT_EQ(share.dataContainerPath, dir.file("data") + "/ovaro/Containers/ovaro.example.notes.share");
+
+    struct stat status {};
+    ASSERT_EQ(::stat((kNotesPlugIns + "ShareToNotes.bundle/Info.plist").c_str(), &status), 0);
+    EXPECT_EQ(p.lastModified(), static_cast<std::int32_t>(status.st_mtim.tv_sec));
+}
+
+TEST_F(OfflineExamples, AnOldStylePlugInIsTranslatedAndGetsHubVersionOne) {
+    OfflinePlugIn legacy = inspectOne(kNotesPlugIns + "LegacyImport.bundle");
+    ASSERT_TRUE(legacy.plugIn);
+    EXPECT_EQ(legacy.error, std::nullopt);
+    EXPECT_EQ(legacy.plugIn->identifier(), "ovaro.example.notes.legacy");
+    EXPECT_EQ(legacy.plugIn->protocolSpec(), Value("LegacyImportProtocol"));
+    EXPECT_EQ(legacy.plugIn->version(), Value("2.0"));
+    EXPECT_EQ(at(legacy.plugIn->attributes(), {"VTExtensionPointName"}), Value("ovaro.import"));
+    EXPECT_EQ(at(legacy.plugIn->attributes(), {"Formats", "ovaro.identifier"}), Value("left alone"));
+    EXPECT_EQ(legacy.plugIn->hubProtocolVersion(), 1u);
+}
+
+TEST_F(OfflineExamples, AnApplicationExtensionGetsItsCanonicalValues) {
+    OfflinePlugIn widget = inspectOne(kNotesPlugIns + "NotesWidget.xbun");
+    ASSERT_TRUE(widget.plugIn);
+    EXPECT_EQ(widget.error, std::nullopt);
+    EXPECT_EQ(widget.plugIn->protocolSpec(), Value("VTObject"));
+    EXPECT_EQ(at(widget.plugIn->plugInDictionary(), {"Shared"}), modeltest::array({"."}));
+    EXPECT_EQ(at(widget.plugIn->plugInDictionary(), {"CleanTimeout"}), Value(10));
+    EXPECT_EQ(at(widget.plugIn->attributes(), {"Size"}), Value("small"));
+}
+
+TEST_F(OfflineExamples, ADataPlugInNeedsNoContainer) {
+    OfflinePlugIn spelling = inspectOne(kNotesPlugIns + "Spelling.bundle");
+    ASSERT_TRUE(spelling.plugIn);
+    EXPECT_EQ(spelling.error, std::nullopt);
+    EXPECT_TRUE(spelling.plugIn->isData());
+    EXPECT_EQ(spelling.dataContainerPath, std::nullopt);
+}
+
+TEST_F(OfflineExamples, AMultiplexedBundleYieldsEachOfItsPlugIns) {
+    auto plugIns = inspect(kStudioPlugIns + "Filters.bundle");
+    ASSERT_EQ(plugIns.size(), 2u);
+    EXPECT_EQ(plugIns[0].identifier, "ovaro.example.studio.blur");
+    EXPECT_EQ(plugIns[1].identifier, "ovaro.example.studio.sharpen");
+    for (const OfflinePlugIn& filter : plugIns) {
+        ASSERT_TRUE(filter.plugIn);
+        EXPECT_EQ(filter.error, std::nullopt);
+        EXPECT_EQ(filter.plugIn->hubProtocolVersion(), 3u);
+        EXPECT_EQ(filter.plugIn->containingPath(), kStudio) << "desktop-style layout";
+        EXPECT_EQ(filter.dataContainerPath, dir.file("data") + "/ovaro/Containers/ovaro.example.studio.filters");
+    }
+    EXPECT_EQ(plugIns[1].plugIn->version(), Value("1.1"));
+    EXPECT_EQ(plugIns[0].plugIn->version(), Value("2.2"));
+}
+
+TEST_F(OfflineExamples, AnIdentifierPicksOnePlugInOrFailsSetup) {
+    auto blur = inspect(kStudioPlugIns + "Filters.bundle", "ovaro.example.studio.blur");
+    ASSERT_EQ(blur.size(), 1u);
+    EXPECT_EQ(at(blur[0].plugIn->attributes(), {"Radius"}), Value(4));
+
+    auto missing = inspect(kStudioPlugIns + "Filters.bundle", "ovaro.example.studio.none");
+    ASSERT_EQ(missing.size(), 1u);
+    EXPECT_FALSE(missing[0].plugIn);
+    ASSERT_TRUE(missing[0].error);
+    EXPECT_TRUE(missing[0].error->text().starts_with("malformed plug-in dictionary in plug-in ovaro.example.studio.none at file://"));
+
+    auto notThere = inspector.inspectBundle(kNotesPlugIns + "Spelling.bundle", "ovaro.other");
+    ASSERT_FALSE(notThere.ok());
+    EXPECT_EQ(notThere.error().code, 12);
+}
+
+TEST_F(OfflineExamples, MisconfiguredPlugInsSayWhy) {
+    const std::pair<const char*, const char*> cases[] = {
+        {"PassProxy.bundle", "the \"PassProxy\" key is not supported on this platform"},
+        {"Hybrid.bundle", "hybrid plug-ins are not supported on this platform"},
+        {"Inspector.xbun", "Application Extensions may not use the \"PrincipalClass\" key"},
+        {"Unregistered.bundle", "missing \"VTExtensionProtocol\" key in Info.plist or SDK"},
+        {"NoExecutable.bundle", "this plug-in has no sandbox data container"},
+    };
+    for (const auto& [bundle, message] : cases) {
+        OfflinePlugIn inspected = inspectOne(kStudioPlugIns + bundle);
+        ASSERT_TRUE(inspected.error) << bundle;
+        EXPECT_EQ(inspected.error->domain, "Quamber") << bundle;
+        EXPECT_EQ(inspected.error->code, 12) << bundle;
+        EXPECT_EQ(inspected.error->text(), message) << bundle;
+    }
+}
+
+TEST_F(OfflineExamples, AnUnreadableBundleIsAnError) {
+    auto broken = inspector.inspectBundle(kStudioPlugIns + "Broken.bundle", std::nullopt);
+    ASSERT_FALSE(broken.ok());
+    EXPECT_EQ(broken.error().code, 12);
+    EXPECT_NE(broken.error().text().find("unreadable Info dictionary"), std::string::npos);
+
+    auto missing = inspector.inspectBundle(kStudioPlugIns + "Nowhere.bundle", std::nullopt);
+    ASSERT_FALSE(missing.ok());
+    EXPECT_EQ(missing.error().code, 9);
+}
+
+TEST_F(OfflineExamples, TheSystemVolumeIsDecidedAtPathComponentBoundaries) {
+    {
+        ScopedEnvironment roots("QM_SYSTEM_ROOTS", "/nonexistent:" + kExamples + "/Applications");
+        EXPECT_TRUE(OfflinePlugIns::isOnSystemVolume(kNotesPlugIns + "Spelling.bundle"));
+        EXPECT_TRUE(inspectOne(kNotesPlugIns + "Spelling.bundle").plugIn->onSystemVolume());
+    }
+    {
+        ScopedEnvironment roots("QM_SYSTEM_ROOTS", kExamples + "/Applications/Notes");
+        EXPECT_FALSE(OfflinePlugIns::isOnSystemVolume(kNotesPlugIns + "Spelling.bundle"))
+            << "Notes.app is not under Notes";
+    }
+    {
+        // Through a symbolic link the bundle still lies under the root.
+        std::string link = dir.file("linked-apps");
+        ASSERT_EQ(::symlink((kExamples + "/Applications").c_str(), link.c_str()), 0);
+        ScopedEnvironment roots("QM_SYSTEM_ROOTS", kExamples + "/Applications");
+        EXPECT_TRUE(OfflinePlugIns::isOnSystemVolume(link + "/Notes.app/PlugIns/Spelling.bundle"));
+    }
+}
+
+TEST(OfflineLayout, TheContainingApplicationComesFromThePlugInsFolder) {
+    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("/a/Foo.app/PlugIns/X.bundle"), "/a/Foo.app");
+    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("/a/Foo.app/Contents/PlugIns/X.xbun"), "/a/Foo.app");
+    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("/a/Foo/PlugIns/X.bundle"), std::nullopt);
+    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("/a/Foo.app/Other/X.bundle"), std::nullopt);
+    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("/a/Foo.app/X.bundle"), std::nullopt);
+    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("X.bundle"), std::nullopt);
+}
+
+TEST(OfflineLayout, DeclaredIdentifiersFollowTheCatalogsRule) {
+    using Ids = std::vector<std::string>;
+    EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(dict({{"MRBundleIdentifier", "b"},
+                                                        {"VTExtension", dict({{"VTExtensionAttributes",
+                                                                               dict({{"VTExtensionIdentifier", "n"}})}})}})),
+              Ids{"n"});
+    EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(dict({{"MRBundleIdentifier", "b"},
+                                                        {"Quamber", dict({{"Attributes",
+                                                                           dict({{"ovaro.identifier", "o"}})}})}})),
+              Ids{"o"});
+    EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(
+                  dict({{"MRBundleIdentifier", "b"},
+                        {"Quamber", dict({{"Multiple", dict({{"m1", dict({})}, {"m2", dict({})}})}})}})),
+              (Ids{"m1", "m2"}));
+    EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(dict({{"MRBundleIdentifier", "b"}, {"VTExtension", dict({})}})),
+              Ids{"b"});
+    EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(dict({{"VTExtension", dict({})}})), Ids{});
+}
+
+TEST(OfflineLayout, TheHubProtocolVersionFollowsTheDaemonsRule) {
+    auto make = [](const Value& info, const char* path) {
+        return QMPlugInCore::initWithName("i", std::string(path), info, Value(), std::nullopt);
+    };
+    auto declared = make(dict({{"Quamber", dict({})}, {"VTExtension", dict({{"HubProtocolVersion", 3}})}}), "/p.bundle");
+    auto old = make(dict({{"Quamber", dict({})}}), "/p.xbun");
+    auto extension = make(dict({{"VTExtension", dict({})}}), "/p.xbun");
+    auto outOfRange = make(dict({{"VTExtension", dict({{"HubProtocolVersion", Value(std::uint64_t{1} << 40)}})}}), "/p.bundle");
+    ASSERT_TRUE(declared && old && extension && outOfRange);
+    EXPECT_EQ(OfflinePlugIns::hubProtocolVersionOf(*declared), 3u);
+    EXPECT_EQ(OfflinePlugIns::hubProtocolVersionOf(*old), 1u);
+    EXPECT_EQ(OfflinePlugIns::hubProtocolVersionOf(*extension), 2u);
+    EXPECT_EQ(OfflinePlugIns::hubProtocolVersionOf(*outOfRange), 2u);
+}
+
+}  // namespace

@@ -1,0 +1,238 @@
+// The plug-in form: what export writes, and that a descriptor survives the
+// trip through the wire (export, packed property list, CBOR, initWithForm).
+
+#include <gtest/gtest.h>
+
+#include "ModelTestSupport.h"
+#include "model/QMPlugInCore.h"
+#include "platform/duct/CborCodec.h"
+
+namespace {
+
+using modeltest::array;
+using modeltest::at;
+using modeltest::dict;
+using modeltest::LogCapture;
+using qm::Value;
+
+const std::string kPath = "/apps/Example.app/PlugIns/Share.bundle";
+
+Value infoDictionary() {
+    return dict({{"MRBundleIdentifier", "com.example.share"},
+                 {"MRBundleVersion", "2.5"},
+                 {"MRBundleInfoPlistURL", "file:///apps/Example.app/PlugIns/Share.bundle/Info.plist"},
+                 {"VTExtension", dict({{"VTExtensionProtocol", "P"},
+                                       {"Shared", array({"Resources"})},
+                                       {"VTExtensionAttributes", dict({{"Category", "notes"}})}})}});
+}
+
+std::unique_ptr<QMPlugInCore> resolvedPlugIn(const Value& info = infoDictionary(), const std::string& identifier = "com.example.share") {
+    auto plugIn = QMPlugInCore::initWithName(identifier, kPath, info, Value(), std::nullopt);
+    if (plugIn) {
+        plugIn->resolveSDK();
+    }
+    return plugIn;
+}
+
+// The wire carries forms inside a packed property list, encoded as CBOR.
+Value throughTheWire(const qm::Dictionary& form) {
+    qm::Bytes payload = qm::cbor::encode(dict({{"matches", Value::packed(Value(qm::Array{Value(form)}))}}));
+    auto decoded = qm::cbor::decode(payload);
+    EXPECT_TRUE(decoded.ok());
+    if (!decoded.ok()) {
+        return Value();
+    }
+    const Value* packed = decoded->get("matches");
+    EXPECT_TRUE(packed && packed->packedContent());
+    if (!packed || !packed->packedContent()) {
+        return Value();
+    }
+    return packed->packedContent()->asArray()->front();
+}
+
+TEST(PlugInForm, ExportWritesEveryKeyOfTheDescriptor) {
+    auto plugIn = resolvedPlugIn();
+    ASSERT_TRUE(plugIn);
+    plugIn->setHubProtocolVersion(2);
+    plugIn->setLastModified(1700000000);
+    plugIn->setOnSystemVolume(true);
+    Value form(plugIn->exportForm());
+
+    EXPECT_EQ(at(form, {"hubProtocolVersion"}), Value(2));
+    EXPECT_EQ(at(form, {"hubProtocolVersion"}).type(), qm::ValueType::unsignedInteger);
+    EXPECT_EQ(at(form, {"path"}), Value(kPath));
+    EXPECT_EQ(at(form, {"systemResident"}), Value(true));
+    EXPECT_EQ(at(form, {"identifier"}), Value("com.example.share"));
+    EXPECT_EQ(at(form, {"version"}), Value("2.5"));
+    EXPECT_EQ(at(form, {"info"}), plugIn->plugInDictionary());
+    EXPECT_EQ(at(form, {"uuid"}), Value(plugIn->uuid()->text()));
+    EXPECT_EQ(at(form, {"lastmodified"}), Value(1700000000));
+    EXPECT_EQ(at(form, {"annotations"}), dict({})) << "no annotations export as an empty dictionary";
+    EXPECT_EQ(at(form, {"bundleInfo"}),
+              Value(plugIn->bundleInfoDictionary().asDictionary()->changing("MRBundleInfoPlistURL", std::nullopt)));
+    EXPECT_EQ(at(form, {"bundleInfo", "VTExtension", "VTExtensionAttributes", "ovaro.format"}), Value("standard"));
+    for (const char* absent : {"containingPath", "localizedContainingDisplayName", "localizedDisplayName",
+                               "localizedShortName", "hash", "requirement"}) {
+        EXPECT_EQ(form.get(absent), nullptr) << absent;
+    }
+}
+
+TEST(PlugInForm, ExportAddsTheOptionalKeysThatHaveValues) {
+    auto plugIn = resolvedPlugIn();
+    ASSERT_TRUE(plugIn);
+    plugIn->setContainingUrl("/apps/Example.app");
+    plugIn->setLocalizedName("Share to Example");
+    plugIn->setLocalizedShortName("Share");
+    plugIn->setLocalizedContainingName("Example");
+    Value form(plugIn->exportForm());
+    EXPECT_EQ(at(form, {"containingPath"}), Value("/apps/Example.app"));
+    EXPECT_EQ(at(form, {"localizedDisplayName"}), Value("Share to Example"));
+    EXPECT_EQ(at(form, {"localizedShortName"}), Value("Share"));
+    EXPECT_EQ(at(form, {"localizedContainingDisplayName"}), Value("Example"));
+}
+
+TEST(PlugInForm, ADescriptorSurvivesTheTripThroughTheWire) {
+    auto original = resolvedPlugIn();
+    ASSERT_TRUE(original);
+    original->setHubProtocolVersion(3);
+    original->setLastModified(-12345);
+    original->setOnSystemVolume(true);
+    original->setContainingUrl("/apps/Example.app");
+    original->setAnnotations(qm::Dictionary{{"election", 1}, {"extension", dict({{"k", "v"}})}});
+    original->setLocalizedName("Share to Example");
+    original->setLocalizedShortName("Share");
+    original->setLocalizedContainingName("Example");
+
+    auto copy = QMPlugInCore::initWithForm(throughTheWire(original->exportForm()));
+    ASSERT_TRUE(copy);
+    EXPECT_TRUE(*copy == *original);
+    EXPECT_EQ(copy->uuid(), original->uuid());
+    EXPECT_EQ(copy->identifier(), original->identifier());
+    EXPECT_EQ(copy->path(), original->path());
+    EXPECT_EQ(copy->bundleInfoDictionary(),
+              Value(original->bundleInfoDictionary().asDictionary()->changing("MRBundleInfoPlistURL", std::nullopt)));
+    EXPECT_EQ(copy->plugInDictionary(), original->plugInDictionary());
+    EXPECT_EQ(copy->topDictionary(), original->topDictionary());
+    EXPECT_EQ(copy->attributes(), original->attributes());
+    EXPECT_EQ(copy->version(), Value("2.5"));
+    EXPECT_EQ(copy->hubProtocolVersion(), 3u);
+    EXPECT_EQ(copy->lastModified(), -12345);
+    EXPECT_TRUE(copy->onSystemVolume());
+    EXPECT_EQ(copy->containingPath(), "/apps/Example.app");
+    EXPECT_EQ(copy->annotations(), original->annotations());
+    EXPECT_EQ(copy->localizedName(), "Share to Example");
+    EXPECT_EQ(copy->localizedShortName(), "Share");
+    EXPECT_EQ(copy->localizedContainingName(), "Example");
+    EXPECT_EQ(copy->diagnose(), std::nullopt);
+    EXPECT_EQ(Value(copy->exportForm()), Value(original->exportForm()));
+}
+
+TEST(PlugInForm, AMultiplexedPlugInComesBackAsItsOwnEntry) {
+    Value info = dict({{"VTExtension", dict({{"Multiple", dict({{"com.example.a", dict({{"VTExtensionProtocol", "A"}})},
+                                                                {"com.example.b", dict({{"VTExtensionProtocol", "B"}})}})}})}});
+    auto original = resolvedPlugIn(info, "com.example.b");
+    ASSERT_TRUE(original);
+    auto copy = QMPlugInCore::initWithForm(throughTheWire(original->exportForm()));
+    ASSERT_TRUE(copy);
+    EXPECT_EQ(copy->protocolSpec(), Value("B"));
+    EXPECT_EQ(copy->plugInDictionary(), original->plugInDictionary());
+    EXPECT_EQ(at(copy->attributes(), {"ovaro.format"}), Value("standard"));
+}
+
+TEST(PlugInForm, MissingKeysReadAsTheirDefaults) {
+    auto original = resolvedPlugIn();
+    ASSERT_TRUE(original);
+    original->setHubProtocolVersion(5);
+    original->setLastModified(77);
+    original->setOnSystemVolume(true);
+    qm::Dictionary form = original->exportForm();
+    for (const char* key : {"hubProtocolVersion", "uuid", "lastmodified", "systemResident", "annotations"}) {
+        form.remove(key);
+    }
+    auto copy = QMPlugInCore::initWithForm(Value(form));
+    ASSERT_TRUE(copy);
+    EXPECT_EQ(copy->hubProtocolVersion(), 1u);
+    ASSERT_TRUE(copy->uuid());
+    EXPECT_FALSE(*copy == *original) << "a form without a UUID gives a fresh one";
+    EXPECT_EQ(copy->lastModified(), 0);
+    EXPECT_FALSE(copy->onSystemVolume());
+    EXPECT_EQ(copy->annotations(), std::nullopt);
+}
+
+TEST(PlugInForm, AMalformedUuidGivesAFreshOne) {
+    auto original = resolvedPlugIn();
+    ASSERT_TRUE(original);
+    auto copy = QMPlugInCore::initWithForm(Value(original->exportForm().changing("uuid", "not-a-uuid")));
+    ASSERT_TRUE(copy);
+    ASSERT_TRUE(copy->uuid());
+    EXPECT_FALSE(*copy == *original);
+}
+
+TEST(PlugInForm, TheSignatureFactsAreReadFromTheForm) {
+    auto original = resolvedPlugIn();
+    ASSERT_TRUE(original);
+    qm::Dictionary form = original->exportForm();
+    form.set("hash", qm::Bytes{1, 2, 3});
+    form.set("requirement", "identifier com.example.share");
+    auto copy = QMPlugInCore::initWithForm(Value(form));
+    ASSERT_TRUE(copy);
+    EXPECT_EQ(copy->cdhash(), (qm::Bytes{1, 2, 3}));
+    EXPECT_EQ(copy->requirement(), "identifier com.example.share");
+}
+
+TEST(PlugInForm, TheFormsInfoIsNotConsulted) {
+    auto original = resolvedPlugIn();
+    ASSERT_TRUE(original);
+    auto copy = QMPlugInCore::initWithForm(Value(original->exportForm().changing("info", dict({{"VTExtensionProtocol", "X"}}))));
+    ASSERT_TRUE(copy);
+    EXPECT_EQ(copy->protocolSpec(), Value("P"));
+}
+
+TEST(PlugInForm, AFormWithoutItsEssentialsSetsNothingUp) {
+    auto original = resolvedPlugIn();
+    ASSERT_TRUE(original);
+    qm::Dictionary form = original->exportForm();
+    LogCapture log;
+    EXPECT_FALSE(QMPlugInCore::initWithForm(Value(form.changing("path", std::nullopt))));
+    EXPECT_FALSE(QMPlugInCore::initWithForm(Value(form.changing("path", 42))));
+    EXPECT_FALSE(QMPlugInCore::initWithForm(Value(form.changing("identifier", std::nullopt))));
+    EXPECT_TRUE(log.contains("missing identifier in plug-in at " + kPath));
+    EXPECT_FALSE(QMPlugInCore::initWithForm(Value(form.changing("bundleInfo", std::nullopt))));
+    EXPECT_TRUE(log.contains("missing Info dictionary in plug-in com.example.share at " + kPath));
+    EXPECT_FALSE(QMPlugInCore::initWithForm(Value(form.changing("bundleInfo", array({})))));
+    EXPECT_FALSE(QMPlugInCore::initWithForm(Value("not a form")));
+}
+
+TEST(PlugInForm, ANeverCanonicalizedDescriptorExportsNoVersion) {
+    Value info = dict({{"VTExtension", dict({{"VTExtensionPointIdentifier", array({})}, {"VTExtensionProtocol", "P"}})}});
+    auto plugIn = resolvedPlugIn(info);
+    ASSERT_TRUE(plugIn);
+    Value form(plugIn->exportForm());
+    EXPECT_EQ(form.get("version"), nullptr);
+    EXPECT_TRUE(QMPlugInCore::initWithForm(form));
+}
+
+TEST(PlugInForm, UpdateFromFormTakesTheAnnotationsOrClearsThem) {
+    auto plugIn = resolvedPlugIn();
+    ASSERT_TRUE(plugIn);
+    plugIn->updateFromForm(dict({{"annotations", dict({{"election", 2}})}}));
+    EXPECT_EQ(plugIn->annotations(), (qm::Dictionary{{"election", 2}}));
+    plugIn->updateFromForm(dict({{"identifier", "ignored"}}));
+    EXPECT_EQ(plugIn->annotations(), std::nullopt);
+    EXPECT_EQ(plugIn->identifier(), "com.example.share");
+}
+
+TEST(PlugInForm, SetAnnotationValueChangesOneEntry) {
+    auto plugIn = resolvedPlugIn();
+    ASSERT_TRUE(plugIn);
+    plugIn->setAnnotationValue("election", Value(1));
+    EXPECT_EQ(plugIn->annotations(), std::nullopt) << "no annotation dictionary to change";
+
+    plugIn->setAnnotations(qm::Dictionary{{"election", 1}, {"extension", dict({})}});
+    plugIn->setAnnotationValue("election", Value(2));
+    EXPECT_EQ(plugIn->annotations(), (qm::Dictionary{{"election", 2}, {"extension", dict({})}}));
+    plugIn->setAnnotationValue("extension", std::nullopt);
+    EXPECT_EQ(plugIn->annotations(), (qm::Dictionary{{"election", 2}}));
+}
+
+}  // namespace
