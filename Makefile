@@ -39,7 +39,7 @@ test-asan: deps
 
 test-tsan: deps
 	@cmake -S . -B build-tsan -DQM_SANITIZE=thread $(CMAKE_FLAGS) >/dev/null
-	cmake --build build-tsan -j $(JOBS)
+	cmake --build build-tsan -j $(JOBS) --target concurrency_tests
 	cd build-tsan && ctest --output-on-failure -j $(JOBS) -L 'queue|transport'
 
 bench: build

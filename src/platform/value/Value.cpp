@@ -346,7 +346,11 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries) {
 }
 
 std::optional<Dictionary> Dictionary::fromEntries(std::vector<Entry> entries) {
-    std::sort(entries.begin(), entries.end(), [](const Entry& a, const Entry& b) { return a.first < b.first; });
+    auto byKey = [](const Entry& a, const Entry& b) { return a.first < b.first; };
+    // Our own encoder writes keys in order, so the common case needs no sort.
+    if (!std::is_sorted(entries.begin(), entries.end(), byKey)) {
+        std::sort(entries.begin(), entries.end(), byKey);
+    }
     auto duplicate = std::adjacent_find(entries.begin(), entries.end(),
                                         [](const Entry& a, const Entry& b) { return a.first == b.first; });
     if (duplicate != entries.end()) {
