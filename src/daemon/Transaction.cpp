@@ -50,7 +50,8 @@ QMDServer& Transaction::server() const noexcept {
 
 void Transaction::dispatch() {
     server().mainQueue().assertCurrent();
-    const std::string* name = request().get(wire::kRequest) ? request().get(wire::kRequest)->asString() : nullptr;
+    const qm::Value* nameValue = request().get(wire::kRequest);
+    const std::string* name = nameValue ? nameValue->asString() : nullptr;
     const qm::Value* versionValue = request().get(wire::kVersion);
     version_ = versionValue ? versionValue->asUnsigned().value_or(0) : 0;
 
@@ -79,7 +80,7 @@ void Transaction::dispatch() {
 void Transaction::done() {
     assert(!finished_ && "a transaction replies once");
     finished_ = true;
-    qm::Value reply(reply_);
+    qm::Value reply(std::move(reply_));
     if (server().verbose() >= 2) {
         server().debug("Replying %@", reply);
     }

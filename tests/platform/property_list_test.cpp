@@ -337,6 +337,19 @@ TEST(PropertyList, BinaryUidsAreRefused) {
     EXPECT_EQ(value.error().domain, qm::plist::kErrorDomain);
 }
 
+TEST(PropertyList, BinaryKeysWithNulAreRefusedBeforeLibplistAssertsOnThem) {
+    qm::Bytes dictionary{0xD1, 1, 2};
+    qm::Bytes key{0x53, 'a', 0, 'b'};
+    auto value = qm::plist::parse(binaryList({dictionary, key, kTrueObject}, 1));
+    ASSERT_FALSE(value.ok());
+    EXPECT_EQ(value.error().code, qm::plist::kErrorMalformed);
+    auto utf16 = qm::plist::parse(binaryList({dictionary, qm::Bytes{0x62, 0, 'a', 0, 0}, kTrueObject}, 1));
+    ASSERT_FALSE(utf16.ok());
+    auto good = qm::plist::parse(binaryList({dictionary, qm::Bytes{0x52, 'a', 'b'}, kTrueObject}, 1));
+    ASSERT_TRUE(good.ok()) << good.error().text();
+    EXPECT_EQ(*good, qm::Value(qm::Dictionary{{"ab", qm::Value(true)}}));
+}
+
 TEST(PropertyList, DeeplyNestedXmlIsRefusedWithoutCrashing) {
     auto nested = [](std::size_t depth, std::string_view between = "") {
         std::string body;

@@ -184,8 +184,12 @@ void PeerConnection::readAvailable(bool& hungUp) {
         }
         ssize_t n = ::recv(socket_.get(), readBuffer_.data() + readEnd_, readBuffer_.size() - readEnd_, MSG_DONTWAIT);
         if (n > 0) {
+            std::size_t room = readBuffer_.size() - readEnd_;
             readEnd_ += static_cast<std::size_t>(n);
             readThisTurn += static_cast<std::size_t>(n);
+            if (static_cast<std::size_t>(n) < room) {
+                break;  // drained for now; level-triggered epoll calls again if more comes
+            }
             continue;
         }
         if (n == 0) {

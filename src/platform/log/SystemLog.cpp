@@ -3,6 +3,10 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <sys/stat.h>
+
+#include <atomic>
+#include <chrono>
 #include <mutex>
 
 #include "platform/env/Environment.h"
@@ -39,6 +43,38 @@ void writeToStderr(std::string_view line) {
     }
 }
 
+// glibc tries to reconnect to /dev/log on every line while no log daemon
+// listens there (a container, an early boot): three wasted system calls per
+// line. So lines go to syslog(3) only while /dev/log exists, which is looked
+// at again at most once a second.
+class SyslogGate {
+public:
+    bool open() {
+        auto now = std::chrono::steady_clock::now().time_since_epoch().count();
+        if (available_.load(std::memory_order_relaxed)) {
+            return true;
+        }
+        auto next = nextProbe_.load(std::memory_order_relaxed);
+        if (now < next || !nextProbe_.compare_exchange_strong(next, now + kProbeInterval)) {
+            return false;
+        }
+        struct stat info{};
+        bool present = ::stat("/dev/log", &info) == 0;
+        available_.store(present);
+        return present;
+    }
+
+private:
+    static constexpr std::int64_t kProbeInterval = 1'000'000'000;  // steady_clock ticks are nanoseconds
+    std::atomic<bool> available_{false};
+    std::atomic<std::int64_t> nextProbe_{0};
+};
+
+SyslogGate& syslogGate() {
+    static SyslogGate gate;
+    return gate;
+}
+
 }  // namespace
 
 void openSystemLog(const char* ident) {
@@ -46,7 +82,9 @@ void openSystemLog(const char* ident) {
 }
 
 void systemLog(int level, std::string_view line) {
-    ::syslog(level, "%.*s", static_cast<int>(line.size()), line.data());
+    if (syslogGate().open()) {
+        ::syslog(level, "%.*s", static_cast<int>(line.size()), line.data());
+    }
     if (environment().logToStderr) {
         writeToStderr(line);
     }

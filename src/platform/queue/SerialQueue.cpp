@@ -69,7 +69,6 @@ void SerialQueue::workerLoop() {
         job = nullptr;  // destroy captures off the lock, still on this thread
         lock.lock();
         running_ = false;
-        wake_.notify_all();
     }
 }
 
@@ -90,12 +89,17 @@ bool SerialQueue::tryClaimIdle() {
 }
 
 void SerialQueue::releaseClaim() {
+    bool jobsWaiting;
     {
         std::lock_guard lock(mutex_);
         running_ = false;
+        jobsWaiting = !pending_.empty();
     }
     // Jobs that arrived while the caller held the queue are the worker's.
-    wake_.notify_all();
+    // Waking it for nothing would cost a context switch per job.
+    if (jobsWaiting) {
+        wake_.notify_all();
+    }
 }
 
 void SerialQueue::async(std::function<void()> job) {

@@ -1,0 +1,211 @@
+#include "Bench.h"
+
+#include <sched.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <map>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "ChildProcess.h"
+#include "EchoServer.h"
+#include "LoadRun.h"
+#include "RoundTripClient.h"
+#include "platform/duct/CborCodec.h"
+#include "platform/duct/Frame.h"
+
+namespace {
+
+constexpr const char* kServiceName = "qmd.bench";
+
+struct BenchRequest {
+    const char* label;
+    qm::Value message;
+    // True when qmd's reply is the one this path must produce.
+    bool (*replyIsExpected)(const qm::Value& reply);
+};
+
+struct Row {
+    std::string request;
+    int clients = 0;
+    bool pinned = false;
+    std::size_t requestBytes = 0;
+    std::size_t replyBytes = 0;
+    LoadResult qmd;
+    LoadResult echo;
+};
+
+bool isUnrecognized(const qm::Value& reply) {
+    const qm::Value* code = reply.get("errorcode");
+    const qm::Value* text = reply.get("error");
+    return code && code->asUnsigned() == 4u && text && text->asString() && *text->asString() == "unrecognized request";
+}
+
+bool isEmptyDictionary(const qm::Value& reply) {
+    return reply.asDictionary() && reply.asDictionary()->empty();
+}
+
+std::vector<BenchRequest> benchRequests() {
+    return {
+        {"envelope", qm::Value(qm::Dictionary{{"request", "x-unknown"}, {"version", std::uint64_t{3}}}), isUnrecognized},
+        {"bulk",
+         qm::Value(qm::Dictionary{{"request", "bulk"}, {"version", std::uint64_t{3}}, {"flags", std::uint64_t{0}}}),
+         isEmptyDictionary},
+    };
+}
+
+// Threads and children created after this inherit the mask.
+bool setAffinity(const cpu_set_t& mask) {
+    return ::sched_setaffinity(0, sizeof mask, &mask) == 0;
+}
+
+bool waitForSocket(const std::string& path, ChildProcess& server) {
+    for (int i = 0; i < 1000; ++i) {
+        if (RoundTripClient::connect(path)) {
+            return true;
+        }
+        if (!server.running()) {
+            return false;
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return false;
+}
+
+ChildProcess startDaemon(const std::string& scratch) {
+    std::map<std::string, std::string> environment = {
+        {"PATH", "/usr/bin:/bin"},
+        {"HOME", scratch},
+        {"QM_DUCT_DIR", scratch + "/duct"},
+        {"XDG_DATA_HOME", scratch + "/data"},
+        {"XDG_CONFIG_HOME", scratch + "/config"},
+        {"XDG_STATE_HOME", scratch + "/state"},
+        {"QM_SYSTEM_ROOTS", scratch + "/roots"},
+        {"QM_SDK_PATH", scratch + "/sdks"},
+    };
+    return ChildProcess::exec({QMD_BINARY_PATH, "-S", kServiceName}, environment, scratch + "/qmd.log");
+}
+
+// qmd's reply payload to the request, checked; nothing when it is not the
+// expected one.
+std::optional<qm::Bytes> probe(const std::string& path, qm::Bytes frame, const BenchRequest& request) {
+    auto client = RoundTripClient::connect(path);
+    if (!client) {
+        return std::nullopt;
+    }
+    const qm::Bytes* payload = client->roundTrip(frame);
+    if (!payload) {
+        return std::nullopt;
+    }
+    auto reply = qm::cbor::decode(*payload);
+    if (!reply || !request.replyIsExpected(*reply)) {
+        std::fprintf(stderr, "qmd_bench: unexpected reply to %s: %s\n", request.label,
+                     reply ? reply->description().c_str() : reply.error().text().c_str());
+        return std::nullopt;
+    }
+    return *payload;
+}
+
+bool measureMode(bool pinned, const std::string& scratch, std::chrono::milliseconds duration, std::vector<Row>& rows) {
+    ChildProcess daemon = startDaemon(scratch);
+    std::string qmdPath = scratch + "/duct/" + kServiceName;
+    if (!waitForSocket(qmdPath, daemon)) {
+        std::fprintf(stderr, "qmd_bench: qmd did not start; see %s/qmd.log\n", scratch.c_str());
+        return false;
+    }
+    for (const BenchRequest& request : benchRequests()) {
+        qm::Bytes frame = *qm::duct::encodeFrame(qm::duct::FrameKind::message, 1, request.message);
+        auto replyPayload = probe(qmdPath, frame, request);
+        if (!replyPayload) {
+            return false;
+        }
+        std::string echoPath = scratch + "/echo.sock";
+        ChildProcess echo = startEchoServer(echoPath, *replyPayload);
+        if (!waitForSocket(echoPath, echo)) {
+            std::fputs("qmd_bench: the echo server did not start\n", stderr);
+            return false;
+        }
+        for (int clients : {1, 8}) {
+            Row row{request.label, clients, pinned, frame.size(), qm::duct::kFrameHeaderSize + replyPayload->size(),
+                    {}, {}};
+            row.echo = runLoad(echoPath, frame, clients, duration);
+            row.qmd = runLoad(qmdPath, frame, clients, duration);
+            if (!row.echo.ok || !row.qmd.ok) {
+                std::fprintf(stderr, "qmd_bench: a connection broke while measuring %s\n", request.label);
+                return false;
+            }
+            rows.push_back(row);
+        }
+    }
+    return true;
+}
+
+// Mean time per round trip, qmd over echo.
+double timeRatio(const Row& row) {
+    return row.echo.roundTripsPerSecond / row.qmd.roundTripsPerSecond;
+}
+
+double p50Ratio(const Row& row) {
+    return row.qmd.p50Micros / row.echo.p50Micros;
+}
+
+void printTable(const std::vector<Row>& rows, double seconds) {
+    std::printf("qmd beside a raw Unix-socket echo of the same frames, %.1f s per figure\n", seconds);
+    std::printf("pinned: daemon, echo server and clients on CPU 0; unpinned: no affinity\n\n");
+    std::printf("%-9s %7s %-8s %9s | %10s %8s %8s | %10s %8s %8s | %9s %7s\n", "request", "clients", "cpu",
+                "frames B", "qmd rt/s", "p50 us", "p99 us", "echo rt/s", "p50 us", "p99 us", "qmd/echo", "p50");
+    for (const Row& row : rows) {
+        std::string frames = std::to_string(row.requestBytes) + "/" + std::to_string(row.replyBytes);
+        std::printf("%-9s %7d %-8s %9s | %10.0f %8.1f %8.1f | %10.0f %8.1f %8.1f | %8.2fx %6.2fx\n",
+                    row.request.c_str(), row.clients, row.pinned ? "pinned" : "unpinned", frames.c_str(),
+                    row.qmd.roundTripsPerSecond, row.qmd.p50Micros, row.qmd.p99Micros, row.echo.roundTripsPerSecond,
+                    row.echo.p50Micros, row.echo.p99Micros, timeRatio(row), p50Ratio(row));
+    }
+    std::printf("\nqmd/echo: time per round trip (echo rt/s over qmd rt/s); p50: qmd p50 over echo p50\n");
+    for (const Row& row : rows) {
+        if (row.request == "envelope" && row.pinned && row.clients == 1) {
+            bool met = timeRatio(row) <= 1.2;
+            std::printf("target: envelope, pinned, 1 client, at most 1.2x the echo: %.2fx (%s)\n", timeRatio(row),
+                        met ? "met" : "missed");
+        }
+    }
+}
+
+}  // namespace
+
+int runBench(const BenchOptions& options) {
+    char scratchTemplate[] = "/tmp/qmd-bench-XXXXXX";
+    if (!::mkdtemp(scratchTemplate)) {
+        std::perror("qmd_bench: mkdtemp");
+        return 1;
+    }
+    std::string scratch = scratchTemplate;
+    for (const char* dir : {"/duct", "/roots", "/sdks", "/data", "/config", "/state"}) {
+        ::mkdir((scratch + dir).c_str(), 0700);
+    }
+    cpu_set_t everywhere;
+    CPU_ZERO(&everywhere);
+    ::sched_getaffinity(0, sizeof everywhere, &everywhere);
+    cpu_set_t cpuZero;
+    CPU_ZERO(&cpuZero);
+    CPU_SET(0, &cpuZero);
+
+    auto duration = std::chrono::milliseconds(static_cast<long long>(options.secondsPerFigure * 1000));
+    std::vector<Row> rows;
+    bool ok = setAffinity(cpuZero) && measureMode(true, scratch, duration, rows);
+    ok = ok && setAffinity(everywhere) && measureMode(false, scratch, duration, rows);
+    if (ok) {
+        printTable(rows, options.secondsPerFigure);
+    }
+    std::error_code ignored;
+    if (ok) {
+        std::filesystem::remove_all(scratch, ignored);
+    }
+    return ok ? 0 : 1;
+}

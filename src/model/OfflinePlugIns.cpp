@@ -1,0 +1,227 @@
+#include "model/OfflinePlugIns.h"
+
+#include <algorithm>
+#include <limits>
+#include <utility>
+
+#include "model/QMError.h"
+#include "platform/bundle/BundleDirectory.h"
+#include "platform/env/Environment.h"
+#include "platform/file/PathFacts.h"
+#include "platform/plist/PropertyList.h"
+
+namespace {
+
+std::optional<std::string> stringAt(const qm::Value& dictionary, std::string_view key) {
+    const qm::Value* value = dictionary.get(key);
+    if (value == nullptr || !value->isString()) {
+        return std::nullopt;
+    }
+    return *value->asString();
+}
+
+// The catalog reads the configuration before any normalization: the top
+// dictionary is "VTExtension", else the old style's "Quamber".
+struct DeclaredTop {
+    qm::Value top;
+    bool oldStyle = false;
+};
+
+DeclaredTop declaredTop(const qm::Value& info) {
+    if (const qm::Value* top = info.get(qmkey::kTop)) {
+        return {*top, false};
+    }
+    if (const qm::Value* top = info.get(qmkey::kOldTop)) {
+        return {*top, true};
+    }
+    return {};
+}
+
+bool declaresMultiple(const qm::Value& info) {
+    return declaredTop(info).top.get(qmkey::kMultiple) != nullptr;
+}
+
+std::optional<std::string> localizedNameOf(const qm::Value& info) {
+    if (auto display = stringAt(info, qmkey::kBundleDisplayName)) {
+        return display;
+    }
+    return stringAt(info, qmkey::kBundleName);
+}
+
+std::int32_t clampedSeconds(std::int64_t seconds) {
+    return static_cast<std::int32_t>(std::clamp<std::int64_t>(seconds, std::numeric_limits<std::int32_t>::min(),
+                                                              std::numeric_limits<std::int32_t>::max()));
+}
+
+// A bundle identifier names a folder of its own under Containers/.
+bool isContainerName(const std::string& name) {
+    return !name.empty() && name != "." && name != ".." && name.find('/') == std::string::npos;
+}
+
+std::string parentOf(const std::string& path) {
+    std::size_t slash = path.find_last_of('/');
+    if (slash == std::string::npos || slash == 0) {
+        return slash == 0 ? "/" : "";
+    }
+    return path.substr(0, slash);
+}
+
+std::string lastComponentOf(const std::string& path) {
+    std::size_t slash = path.find_last_of('/');
+    return slash == std::string::npos ? path : path.substr(slash + 1);
+}
+
+}  // namespace
+
+OfflinePlugIns::OfflinePlugIns(SdkRegistry registry) : registry_(std::move(registry)) {}
+
+qm::Result<std::vector<OfflinePlugIn>> OfflinePlugIns::inspectBundle(
+    const std::string& bundlePath, const std::optional<std::string>& identifier) const {
+    auto resolved = qm::resolvedPath(bundlePath);
+    std::optional<qm::BundleDirectory> bundle;
+    if (resolved.ok()) {
+        bundle = qm::BundleDirectory::atPath(*resolved);
+    }
+    if (!bundle) {
+        return QMErrorWithFormat(kQMErrorPath, "no plug-in bundle at %@", bundlePath);
+    }
+    const std::string& path = bundle->path();
+    auto info = bundle->infoDictionary();
+    if (!info) {
+        // Say why, so that a developer need not go looking in the log.
+        auto read = qm::plist::readFile(bundle->infoPlistPath());
+        std::string reason = read.ok() ? "not a dictionary" : read.error().text();
+        return QMErrorWithFormat(kQMErrorPlugInUnusable, "unreadable Info dictionary in plug-in bundle at %@: %@", path,
+                                 reason);
+    }
+
+    std::vector<std::optional<std::string>> identifiers;
+    const std::vector<std::string> declared = declaredIdentifiers(*info);
+    if (identifier) {
+        // A multiplexed bundle is asked for the named entry, so a missing one
+        // fails setup as it would in the daemon.
+        if (!declaresMultiple(*info) && std::find(declared.begin(), declared.end(), *identifier) == declared.end()) {
+            return QMErrorWithFormat(kQMErrorPlugInUnusable, "no plug-in %@ in the bundle at %@", *identifier, path);
+        }
+        identifiers.emplace_back(*identifier);
+    } else {
+        identifiers.assign(declared.begin(), declared.end());
+    }
+    if (identifiers.empty()) {
+        identifiers.emplace_back(std::nullopt);  // setup then says what is missing
+    }
+
+    const std::optional<std::string> containingPath = containingApplicationPath(path);
+    std::optional<std::string> containingName;
+    if (containingPath) {
+        if (auto application = qm::BundleDirectory::atPath(*containingPath)) {
+            if (auto applicationInfo = application->infoDictionary()) {
+                containingName = localizedNameOf(*applicationInfo);
+            }
+        }
+    }
+    auto modified = qm::modificationTime(bundle->infoPlistPath());
+    const bool systemVolume = isOnSystemVolume(path);
+    const std::optional<std::string> executable = stringAt(*info, qmkey::kBundleExecutable);
+    const std::optional<std::string> bundleIdentifier = stringAt(*info, qmkey::kBundleIdentifier);
+
+    std::vector<OfflinePlugIn> plugIns;
+    for (const auto& id : identifiers) {
+        OfflinePlugIn inspected;
+        inspected.identifier = id;
+        auto plugIn = std::make_unique<QMPlugInCore>();
+        if (auto failure = plugIn->setupWithNameExplained(id, path, *info, qm::Value(), std::nullopt)) {
+            inspected.error = std::move(failure);
+            plugIns.push_back(std::move(inspected));
+            continue;
+        }
+        plugIn->setLastModified(modified.ok() ? clampedSeconds(*modified) : 0);
+        plugIn->setOnSystemVolume(systemVolume);
+        plugIn->resolveSDK(registry_);
+        plugIn->setHubProtocolVersion(hubProtocolVersionOf(*plugIn));
+        plugIn->setContainingUrl(containingPath);
+        plugIn->setLocalizedName(localizedNameOf(*info));
+        plugIn->setLocalizedShortName(stringAt(*info, qmkey::kBundleName));
+        plugIn->setLocalizedContainingName(containingName);
+        inspected.error = plugIn->diagnose();
+
+        // The catalog makes a data container for a bundle that names an
+        // executable; a code plug-in without one is refused by the daemon.
+        if (!plugIn->isData()) {
+            if (executable && !executable->empty() && bundleIdentifier && isContainerName(*bundleIdentifier)) {
+                inspected.dataContainerPath = qm::xdgDataHome() + "/ovaro/Containers/" + *bundleIdentifier;
+            } else if (!inspected.error) {
+                inspected.error = QMError(kQMErrorPlugInUnusable, "this plug-in has no sandbox data container");
+            }
+        }
+        inspected.plugIn = std::move(plugIn);
+        plugIns.push_back(std::move(inspected));
+    }
+    return plugIns;
+}
+
+std::vector<std::string> OfflinePlugIns::declaredIdentifiers(const qm::Value& infoDictionary) {
+    const DeclaredTop declared = declaredTop(infoDictionary);
+    if (const qm::Value* multiple = declared.top.get(qmkey::kMultiple)) {
+        if (const qm::Dictionary* entries = multiple->asDictionary()) {
+            std::vector<std::string> identifiers;
+            for (const auto& entry : *entries) {
+                identifiers.push_back(entry.first);
+            }
+            return identifiers;
+        }
+    }
+    const char* attributesKey = declared.oldStyle ? "Attributes" : qmkey::kAttributes;
+    const char* identifierKey = declared.oldStyle ? "ovaro.identifier" : qmkey::kExtensionIdentifier;
+    if (const qm::Value* attributes = declared.top.get(attributesKey)) {
+        if (auto identifier = stringAt(*attributes, identifierKey)) {
+            return {*identifier};
+        }
+    }
+    if (auto identifier = stringAt(infoDictionary, qmkey::kBundleIdentifier)) {
+        return {*identifier};
+    }
+    return {};
+}
+
+std::optional<std::string> OfflinePlugIns::containingApplicationPath(const std::string& bundlePath) {
+    std::string plugInsDirectory = parentOf(bundlePath);
+    if (lastComponentOf(plugInsDirectory) != "PlugIns") {
+        return std::nullopt;
+    }
+    std::string support = parentOf(plugInsDirectory);
+    if (lastComponentOf(support) == "Contents") {
+        std::string application = parentOf(support);
+        if (application.ends_with(".app")) {
+            return application;
+        }
+    }
+    if (support.ends_with(".app")) {
+        return support;
+    }
+    return std::nullopt;
+}
+
+bool OfflinePlugIns::isOnSystemVolume(const std::string& bundlePath) {
+    auto resolved = qm::resolvedPath(bundlePath);
+    if (!resolved.ok()) {
+        return false;
+    }
+    for (const std::string& root : qm::systemRoots()) {
+        auto resolvedRoot = qm::resolvedPath(root);
+        if (resolvedRoot.ok() && qm::isPathWithin(*resolved, *resolvedRoot)) {
+            return true;
+        }
+    }
+    return false;
+}
+
+std::uint32_t OfflinePlugIns::hubProtocolVersionOf(const QMPlugInCore& plugIn) {
+    const qm::Value top = plugIn.topDictionary();
+    if (const qm::Value* declared = top.get(qmkey::kHubProtocolVersion)) {
+        if (auto version = declared->asUnsigned(); version && *version <= std::numeric_limits<std::uint32_t>::max()) {
+            return static_cast<std::uint32_t>(*version);
+        }
+    }
+    return plugIn.bundleInfoDictionary().get(qmkey::kOldTop) != nullptr ? 1 : 2;
+}
