@@ -7,7 +7,7 @@ namespace qm {
 
 namespace {
 
-struct Spec {
+struct Directive {
     std::string flags;   // flags, width and precision as written
     std::string length;  // hh h l ll z j t L q
     char conversion = 0;
@@ -21,9 +21,9 @@ bool isLength(char c) {
     return c == 'h' || c == 'l' || c == 'z' || c == 'j' || c == 't' || c == 'L' || c == 'q';
 }
 
-std::string printfOne(const std::string& spec, auto value) {
+std::string printfOne(const std::string& directive, auto value) {
     char buffer[128];
-    int n = std::snprintf(buffer, sizeof buffer, spec.c_str(), value);
+    int n = std::snprintf(buffer, sizeof buffer, directive.c_str(), value);
     if (n < 0) {
         return {};
     }
@@ -31,7 +31,7 @@ std::string printfOne(const std::string& spec, auto value) {
         return std::string(buffer, static_cast<std::size_t>(n));
     }
     std::string big(static_cast<std::size_t>(n) + 1, '\0');
-    std::snprintf(big.data(), big.size(), spec.c_str(), value);
+    std::snprintf(big.data(), big.size(), directive.c_str(), value);
     big.resize(static_cast<std::size_t>(n));
     return big;
 }
@@ -61,14 +61,14 @@ std::string textOf(const FormatArg& arg) {
     return {};
 }
 
-std::string convert(const Spec& spec, const FormatArg& arg) {
-    const bool wide = !spec.length.empty() && spec.length != "h" && spec.length != "hh";
-    std::string base = "%" + spec.flags;
-    switch (spec.conversion) {
+std::string convert(const Directive& directive, const FormatArg& arg) {
+    const bool wide = !directive.length.empty() && directive.length != "h" && directive.length != "hh";
+    std::string base = "%" + directive.flags;
+    switch (directive.conversion) {
         case '@':
         case 's': {
             std::string text = textOf(arg);
-            return spec.flags.empty() ? text : printfOne(base + "s", text.c_str());
+            return directive.flags.empty() ? text : printfOne(base + "s", text.c_str());
         }
         case 'd':
         case 'i':
@@ -87,13 +87,13 @@ std::string convert(const Spec& spec, const FormatArg& arg) {
                 return textOf(arg);
             }
             if (wide) {
-                const char* c = spec.conversion == 'u'   ? PRIu64
-                                : spec.conversion == 'x' ? PRIx64
-                                : spec.conversion == 'X' ? PRIX64
+                const char* c = directive.conversion == 'u'   ? PRIu64
+                                : directive.conversion == 'x' ? PRIx64
+                                : directive.conversion == 'X' ? PRIX64
                                                          : PRIo64;
                 return printfOne(base + c, unsignedValue(arg));
             }
-            return printfOne(base + spec.conversion, static_cast<std::uint32_t>(unsignedValue(arg)));
+            return printfOne(base + directive.conversion, static_cast<std::uint32_t>(unsignedValue(arg)));
         case 'c':
             return isInteger(arg) ? std::string(1, static_cast<char>(unsignedValue(arg))) : textOf(arg);
         case 'p':
@@ -108,7 +108,7 @@ std::string convert(const Spec& spec, const FormatArg& arg) {
                        : arg.kind == FormatArg::Kind::Signed   ? static_cast<double>(arg.i)
                        : arg.kind == FormatArg::Kind::Unsigned ? static_cast<double>(arg.u)
                                                                : 0.0;
-            return printfOne(base + spec.conversion, d);
+            return printfOne(base + directive.conversion, d);
         }
         default:
             return textOf(arg);
@@ -133,22 +133,22 @@ std::string formatArgs(std::string_view format, const std::vector<FormatArg>& ar
             continue;
         }
         std::size_t j = i + 1;
-        Spec spec;
+        Directive directive;
         while (j < format.size() && isFlagOrWidth(format[j])) {
-            spec.flags += format[j++];
+            directive.flags += format[j++];
         }
         while (j < format.size() && isLength(format[j])) {
-            spec.length += format[j++];
+            directive.length += format[j++];
         }
         if (j >= format.size()) {
             out.append(format.substr(i));  // a dangling '%' prints as written
             break;
         }
-        spec.conversion = format[j];
+        directive.conversion = format[j];
         static const FormatArg missing;
         const FormatArg& arg = next < args.size() ? args[next] : missing;
         ++next;
-        out += convert(spec, arg);
+        out += convert(directive, arg);
         i = j;
     }
     return out;
