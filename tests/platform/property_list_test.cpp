@@ -278,10 +278,12 @@ TEST(PropertyList, ScalarAndEmptyRoots) {
 }
 
 TEST(PropertyList, DuplicateKeysInXmlKeepOneValue) {
-    auto value = parseText(xmlDocument("<dict><key>a</key><integer>1</integer><key>a</key><integer>2</integer></dict>"));
+    auto value =
+        parseText(xmlDocument("<dict><key>a</key><integer>1</integer><key>a</key><integer>2</integer></dict>"));
     ASSERT_TRUE(value.ok()) << value.error().text();
     EXPECT_EQ(value->asDictionary()->size(), 1u);
-    EXPECT_TRUE(value->get("a")->asSigned());
+    auto kept = value->get("a")->asSigned();
+    EXPECT_TRUE(kept == 1 || kept == 2);
 }
 
 TEST(PropertyList, MalformedDocumentsAreErrors) {

@@ -115,9 +115,10 @@ std::optional<BundleDirectory> BundleDirectory::atPath(const std::string& bundle
     }
     auto state = std::make_shared<State>();
     state->path = *path;
+    std::string contents = joinPath(*path, kContentsFolder);
     if (isRegularFile(joinPath(*path, kInfoFileName))) {
         state->infoFolder = *path;
-    } else if (std::string contents = joinPath(*path, kContentsFolder); isRegularFile(joinPath(contents, kInfoFileName))) {
+    } else if (isRegularFile(joinPath(contents, kInfoFileName))) {
         state->infoFolder = contents;
         state->desktopStyle = true;
     } else {

@@ -21,9 +21,10 @@
 // - libplist's UID nodes are refused when read.
 //
 // Hostile input: files over 64 MiB are refused before reading; nesting deeper
-// than 512 containers and binary lists whose shared objects would expand to
-// more than 4 Mi nodes are refused before libplist builds anything (libplist
-// recurses once per level and copies shared objects).
+// than 512 containers, binary lists whose shared objects would expand to more
+// than 4 Mi nodes and binary keys with NUL are refused before libplist builds
+// anything (it recurses once per level, copies shared objects and asserts on
+// such keys). Every function may be called from any thread.
 
 #include <cstdint>
 #include <span>
