@@ -60,10 +60,6 @@ void QMDServer::run() {
     loop_->run();
 }
 
-void QMDServer::submitWork(std::function<void()> work) {
-    mainQueue_->async(std::move(work));
-}
-
 void QMDServer::unholdClient(const QMDDuctClient& /*client*/) {
     // Holds are taken by the "lock" request; until it is served a client
     // owns none, and there is nothing to release.

@@ -37,7 +37,10 @@ public:
     void run();
 
     // Submits a work item to mainQueue: the only way transactions reach it.
-    void submitWork(std::function<void()> work);
+    template <class Work>
+    void submitWork(Work&& work) {
+        mainQueue_->async(std::forward<Work>(work));
+    }
 
     // Releases every hold that the client owns; enters syncQueue synchronously.
     void unholdClient(const QMDDuctClient& client);

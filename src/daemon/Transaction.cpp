@@ -87,10 +87,10 @@ void Transaction::done() {
     request_.reply(reply);
 }
 
-void Transaction::fail(int code, const std::optional<std::string>& message) {
+void Transaction::fail(int code, std::optional<std::string> message) {
     reply_.set(wire::kErrorCode, static_cast<std::uint64_t>(static_cast<std::int64_t>(code)));
     if (message) {
-        reply_.set(wire::kError, *message);
+        reply_.set(wire::kError, qm::Value(std::move(*message)));
     }
     done();
 }

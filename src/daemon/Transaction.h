@@ -28,7 +28,7 @@ public:
     void done();
     // fail:message: — writes "errorcode" (sign-extended) and "error" (when
     // there is a message), then done().
-    void fail(int code, const std::optional<std::string>& message);
+    void fail(int code, std::optional<std::string> message);
     // fail:error: — an error of the daemon's own domain keeps its own code.
     void fail(int code, const qm::Error& error);
 

@@ -35,7 +35,9 @@ void writeFrameHeader(std::uint8_t* sixteenBytes, const FrameHeader& header) {
 }
 
 std::optional<Bytes> encodeFrame(FrameKind kind, std::uint64_t messageId, const Value& payload) {
-    Bytes frame(kFrameHeaderSize);
+    Bytes frame;
+    frame.reserve(kFrameHeaderSize + 256);  // the encoder's first claim fits: one allocation
+    frame.resize(kFrameHeaderSize);
     cbor::encode(payload, frame);
     std::size_t payloadLength = frame.size() - kFrameHeaderSize;
     if (payloadLength > kMaxPayloadSize) {

@@ -72,11 +72,20 @@ void SerialQueue::workerLoop() {
     }
 }
 
-void SerialQueue::runAsCurrent(const std::function<void()>& job) {
+const SerialQueue* SerialQueue::enterQueue() noexcept {
     const SerialQueue* outer = currentQueue;
     currentQueue = this;
-    job();
+    return outer;
+}
+
+void SerialQueue::leaveQueue(const SerialQueue* outer) noexcept {
     currentQueue = outer;
+}
+
+void SerialQueue::runAsCurrent(const std::function<void()>& job) {
+    const SerialQueue* outer = enterQueue();
+    job();
+    leaveQueue(outer);
 }
 
 bool SerialQueue::tryClaimIdle() {
@@ -102,13 +111,8 @@ void SerialQueue::releaseClaim() {
     }
 }
 
-void SerialQueue::async(std::function<void()> job) {
+void SerialQueue::enqueue(std::function<void()> job) {
     assert(job);
-    if (runsInlineWhenIdle_ && !isCurrent() && tryClaimIdle()) {
-        runAsCurrent(job);
-        releaseClaim();
-        return;
-    }
     {
         std::lock_guard lock(mutex_);
         pending_.push_back(std::move(job));

@@ -40,7 +40,16 @@ public:
     SerialQueue(const SerialQueue&) = delete;
     SerialQueue& operator=(const SerialQueue&) = delete;
 
-    void async(std::function<void()> job);
+    // The job runs once; on an idle inline queue, before async() returns.
+    template <class Job>
+    void async(Job&& job) {
+        if (runsInlineWhenIdle_ && !isCurrent() && tryClaimIdle()) {
+            // No std::function (and no allocation) on the inline path.
+            runInline(job);
+            return;
+        }
+        enqueue(std::function<void()>(std::forward<Job>(job)));
+    }
     // Blocks until the job has run on this queue.
     void sync(const std::function<void()>& job);
 
@@ -54,7 +63,17 @@ public:
 
 private:
     void workerLoop();
+    void enqueue(std::function<void()> job);
     void runAsCurrent(const std::function<void()>& job);
+    template <class Job>
+    void runInline(Job& job) {
+        const SerialQueue* outer = enterQueue();
+        job();
+        leaveQueue(outer);
+        releaseClaim();
+    }
+    const SerialQueue* enterQueue() noexcept;
+    void leaveQueue(const SerialQueue* outer) noexcept;
     bool tryClaimIdle();           // takes the queue for the calling thread when idle
     void releaseClaim();
 
