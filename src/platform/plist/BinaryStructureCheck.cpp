@@ -11,14 +11,6 @@ namespace qm::plist {
 
 namespace {
 
-qm::Error malformed(const std::string& what) {
-    return plistError(kErrorMalformed, "not a property list: " + what);
-}
-
-qm::Error tooDeep(unsigned maxNesting) {
-    return plistError(kErrorTooComplex, "property list nested deeper than " + std::to_string(maxNesting) + " levels");
-}
-
 // The binary layout (all numbers big-endian): "bplist00", the objects, an
 // offset table (one offset per object), and a 32-byte trailer: 6 unused
 // bytes, the offset size, the reference size, the object count, the top

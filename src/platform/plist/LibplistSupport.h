@@ -34,6 +34,15 @@ inline qm::Error plistError(ErrorCode code, std::string text) {
     return qm::Error{kErrorDomain, code, std::move(text)};
 }
 
+// The two refusals shared by the structure checks of both formats.
+inline qm::Error malformed(const std::string& what) {
+    return plistError(kErrorMalformed, "not a property list: " + what);
+}
+
+inline qm::Error tooDeep(unsigned maxNesting) {
+    return plistError(kErrorTooComplex, "property list nested deeper than " + std::to_string(maxNesting) + " levels");
+}
+
 // A path like "/Plugins/3/name" that says where in a tree an error lies.
 class TreePath {
 public:

@@ -8,14 +8,6 @@ namespace qm::plist {
 
 namespace {
 
-qm::Error malformed(const std::string& what) {
-    return plistError(kErrorMalformed, "not a property list: " + what);
-}
-
-qm::Error tooDeep(unsigned maxNesting) {
-    return plistError(kErrorTooComplex, "property list nested deeper than " + std::to_string(maxNesting) + " levels");
-}
-
 bool isXmlSpace(char c) {
     return c == ' ' || c == '\t' || c == '\r' || c == '\n';
 }
