@@ -64,7 +64,9 @@ void Transaction::dispatch() {
     if (!client_->acceptWork()) {
         return;  // the client is dead: no handler, no reply
     }
-    server().debug("client %d request %s", client_->pid(), name ? name->c_str() : nullptr);
+    if (server().verbose() != 0) {  // the pid costs a lookup: only when the line is written
+        server().debug("client %d request %s", client_->pid(), name ? name->c_str() : nullptr);
+    }
     if (name == nullptr) {
         fail(kQMErrorInvalidRequest, std::string("invalid request format (missing type)"));
         return;

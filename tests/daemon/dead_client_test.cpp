@@ -8,43 +8,17 @@
 
 #include "daemon/QMDServer.h"
 #include "platform/log/SystemLog.h"
+#include "support/LogCapture.h"
 #include "support/RawClient.h"
+#include "support/ScopedEnvironment.h"
 #include "support/TempDir.h"
 
 namespace {
 
-class CapturedLog {
-public:
-    CapturedLog() {
-        qm::setLogObserver([this](int, std::string_view line) {
-            std::lock_guard lock(mutex_);
-            text_.append(line).append("\n");
-        });
-    }
-    ~CapturedLog() { qm::setLogObserver(nullptr); }
-    std::string text() {
-        std::lock_guard lock(mutex_);
-        return text_;
-    }
-    bool waitFor(const std::string& needle) {
-        for (int i = 0; i < 500; ++i) {
-            if (text().find(needle) != std::string::npos) {
-                return true;
-            }
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        }
-        return false;
-    }
-
-private:
-    std::mutex mutex_;
-    std::string text_;
-};
-
 TEST(DeadClient, QueuedRequestsOfADeadClientGetNoHandlerAndNoReply) {
     qmtest::TempDir dir;
-    ::setenv("QM_DUCT_DIR", dir.file("duct").c_str(), 1);
-    CapturedLog log;
+    qmtest::ScopedEnvironment ductDirectory("QM_DUCT_DIR", dir.file("duct"));
+    qmtest::LogCapture log;
     auto server = QMDServer::initForService("dead.qmd", std::nullopt);
     ASSERT_TRUE(server) << server.error().text();
     (*server)->setVerbose(1);
@@ -95,7 +69,6 @@ TEST(DeadClient, QueuedRequestsOfADeadClientGetNoHandlerAndNoReply) {
 
     (*server)->eventLoop().stop();
     loop.join();
-    ::unsetenv("QM_DUCT_DIR");
 }
 
 }  // namespace

@@ -10,9 +10,12 @@
 
 #include "platform/log/SystemLog.h"
 #include "platform/plist/PropertyList.h"
+#include "support/LogCapture.h"
 #include "support/TempDir.h"
 
 namespace {
+
+using qmtest::LogCapture;
 
 void writeInfo(const std::string& path, const qm::Dictionary& info) {
     qmtest::writeFile(path, "");
@@ -36,33 +39,6 @@ std::string makeDesktopBundle(const qmtest::TempDir& dir, const std::string& nam
     qmtest::writeFile(bundle + "/Contents/Exec/Foo", "#!/bin/sh\n");
     return bundle;
 }
-
-// Collects the log lines written while it lives.
-class LogCapture {
-public:
-    LogCapture() {
-        qm::setLogObserver([this](int, std::string_view line) {
-            std::lock_guard lock(mutex_);
-            lines_.emplace_back(line);
-        });
-    }
-    ~LogCapture() { qm::setLogObserver(nullptr); }
-    std::vector<std::string> lines() {
-        std::lock_guard lock(mutex_);
-        return lines_;
-    }
-    std::size_t countContaining(const std::string& text) {
-        std::size_t count = 0;
-        for (const auto& line : lines()) {
-            count += line.find(text) != std::string::npos;
-        }
-        return count;
-    }
-
-private:
-    std::mutex mutex_;
-    std::vector<std::string> lines_;
-};
 
 TEST(BundleDirectory, FlatBundle) {
     qmtest::TempDir dir;

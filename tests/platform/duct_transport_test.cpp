@@ -11,6 +11,7 @@
 #include "platform/duct/Listener.h"
 #include "platform/duct/ServiceSocket.h"
 #include "support/RawClient.h"
+#include "support/ScopedEnvironment.h"
 #include "support/TempDir.h"
 
 namespace {
@@ -24,7 +25,6 @@ using qm::duct::PeerConnection;
 class Harness {
 public:
     Harness() {
-        ::setenv("QM_DUCT_DIR", dir_.file("duct").c_str(), 1);
         loop_ = std::move(qm::EventLoop::create()).value();
         auto listener = qm::duct::Listener::create(*loop_, "transport.test", queue_);
         EXPECT_TRUE(listener) << (listener ? "" : listener.error().text());
@@ -51,7 +51,6 @@ public:
     ~Harness() {
         loop_->stop();
         thread_.join();
-        ::unsetenv("QM_DUCT_DIR");
     }
 
     std::string socketPath() const { return dir_.file("duct") + "/transport.test"; }
@@ -85,6 +84,7 @@ public:
 
 private:
     qmtest::TempDir dir_;
+    qmtest::ScopedEnvironment ductDirectory_{"QM_DUCT_DIR", dir_.file("duct")};
     std::unique_ptr<qm::EventLoop> loop_;
     qm::SerialQueue queue_{"duct.test"};
     std::shared_ptr<qm::duct::Listener> listener_;

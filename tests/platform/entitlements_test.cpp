@@ -10,30 +10,14 @@
 
 #include "platform/log/SystemLog.h"
 #include "platform/plist/PropertyList.h"
+#include "support/LogCapture.h"
 #include "support/TempDir.h"
 
 namespace {
 
+using qmtest::LogCapture;
+
 constexpr uid_t kNobody = 65534;
-
-class LogCapture {
-public:
-    LogCapture() {
-        qm::setLogObserver([this](int, std::string_view line) {
-            std::lock_guard lock(mutex_);
-            lines_.emplace_back(line);
-        });
-    }
-    ~LogCapture() { qm::setLogObserver(nullptr); }
-    std::vector<std::string> lines() {
-        std::lock_guard lock(mutex_);
-        return lines_;
-    }
-
-private:
-    std::mutex mutex_;
-    std::vector<std::string> lines_;
-};
 
 const qm::Value kGranted(qm::Dictionary{{"ovaro.developer.replace-plugin", qm::Value(true)},
                                         {"ovaro.developer.quamber.allowedplugins",

@@ -1,0 +1,62 @@
+#pragma once
+// Collects every system-log line written in this process while it lives.
+
+#include <chrono>
+#include <mutex>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <vector>
+
+#include "platform/log/SystemLog.h"
+
+namespace qmtest {
+
+class LogCapture {
+public:
+    LogCapture() {
+        qm::setLogObserver([this](int, std::string_view line) {
+            std::lock_guard lock(mutex_);
+            lines_.emplace_back(line);
+        });
+    }
+    ~LogCapture() { qm::setLogObserver(nullptr); }
+    LogCapture(const LogCapture&) = delete;
+    LogCapture& operator=(const LogCapture&) = delete;
+
+    std::vector<std::string> lines() const {
+        std::lock_guard lock(mutex_);
+        return lines_;
+    }
+    std::string text() const {
+        std::string all;
+        for (const auto& line : lines()) {
+            all.append(line).append("\n");
+        }
+        return all;
+    }
+    std::size_t countContaining(const std::string& needle) const {
+        std::size_t count = 0;
+        for (const auto& line : lines()) {
+            count += line.find(needle) != std::string::npos ? 1 : 0;
+        }
+        return count;
+    }
+    bool contains(const std::string& needle) const { return countContaining(needle) > 0; }
+    // Waits up to five seconds for a line holding the text.
+    bool waitFor(const std::string& needle) const {
+        for (int i = 0; i < 500; ++i) {
+            if (contains(needle)) {
+                return true;
+            }
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        }
+        return false;
+    }
+
+private:
+    mutable std::mutex mutex_;
+    std::vector<std::string> lines_;
+};
+
+}  // namespace qmtest
