@@ -4,6 +4,10 @@
 
 #include <atomic>
 #include <condition_variable>
+#include <cstdio>
+#include <cstdlib>
+#include <functional>
+#include <future>
 #include <mutex>
 #include <thread>
 #include <vector>
@@ -67,26 +71,67 @@ TEST(SerialQueue, JobsFromManyThreadsRunOneAtATimeInEachThreadsOrder) {
     }
 }
 
-TEST(SerialQueue, SyncFromAnotherQueueRunsOnTheTargetAndReturnsAfterIt) {
+// Every nesting the daemon's lock order allows finishes, whichever queues
+// run inline: X stands for mainQueue, Y and Z for the registry queue and
+// syncQueue. A deadlock would hang the test; a watchdog turns it into a failure.
+TEST(SerialQueue, NestingsTheLockOrderAllowsNeverDeadlock) {
+    struct Queues {
+        SerialQueue x{"x", qm::QualityOfService::userInitiated, /*runsInlineWhenIdle=*/true};
+        SerialQueue y{"y", qm::QualityOfService::standard, /*runsInlineWhenIdle=*/true};
+        SerialQueue z{"z", qm::QualityOfService::standard, /*runsInlineWhenIdle=*/true};
+    };
+    using Finish = std::function<void()>;
+    struct Nesting {
+        const char* name;
+        std::function<void(Queues&, Finish)> run;
+    };
+    const Nesting nestings[] = {
+        {"X.sync -> Y.async -> X.sync",
+         [](Queues& q, Finish finish) { q.x.sync([&q, finish] { q.y.async([&q, finish] { q.x.sync(finish); }); }); }},
+        {"X.async -> Y.async -> X.sync",
+         [](Queues& q, Finish finish) { q.x.async([&q, finish] { q.y.async([&q, finish] { q.x.sync(finish); }); }); }},
+        {"X.async -> Y.sync, then Z.sync",
+         [](Queues& q, Finish finish) {
+             q.x.async([&q, finish] {
+                 q.y.sync([] {});
+                 q.z.sync(finish);
+             });
+         }},
+        {"X.sync -> Y.sync -> Z.async -> Y.sync",
+         [](Queues& q, Finish finish) { q.x.sync([&q, finish] { q.y.sync([&q, finish] { q.z.async([&q, finish] { q.y.sync(finish); }); }); }); }},
+        {"X.async -> Y.sync -> X.async",
+         [](Queues& q, Finish finish) { q.x.async([&q, finish] { q.y.sync([&q, finish] { q.x.async(finish); }); }); }},
+    };
+    for (const Nesting& nesting : nestings) {
+        SCOPED_TRACE(nesting.name);
+        Queues queues;
+        std::promise<void> finished;
+        auto ran = finished.get_future();
+        std::thread([&] { nesting.run(queues, [&] { finished.set_value(); }); }).detach();
+        if (ran.wait_for(std::chrono::seconds(10)) != std::future_status::ready) {
+            std::fprintf(stderr, "deadlock: %s\n", nesting.name);
+            std::_Exit(1);
+        }
+        queues.x.sync([] {});
+        queues.y.sync([] {});
+        queues.z.sync([] {});
+    }
+}
+
+TEST(SerialQueue, AJobOnAQueueNeverRunsAnotherQueuesAsyncJobInline) {
     SerialQueue outer("outer");
-    SerialQueue inner("inner");
-    bool innerWasCurrent = false;
-    bool outerWasCurrentInside = true;
-    bool outerCurrentAfter = false;
-    int value = 0;
+    SerialQueue inner("inner", qm::QualityOfService::userInitiated, /*runsInlineWhenIdle=*/true);
+    std::promise<std::thread::id> innerRanOn;
+    std::thread::id outerRanOn;
+    bool outerCurrentInsideSync = true;
     outer.sync([&] {
-        inner.sync([&] {
-            innerWasCurrent = inner.isCurrent();
-            outerWasCurrentInside = outer.isCurrent();
-            value = 42;
-        });
-        outerCurrentAfter = outer.isCurrent();
+        outerRanOn = std::this_thread::get_id();
+        inner.async([&] { innerRanOn.set_value(std::this_thread::get_id()); });
+        inner.sync([&] { outerCurrentInsideSync = outer.isCurrent() || !inner.isCurrent(); });
+        EXPECT_TRUE(outer.isCurrent());
     });
-    EXPECT_TRUE(innerWasCurrent);
-    EXPECT_FALSE(outerWasCurrentInside);
-    EXPECT_TRUE(outerCurrentAfter);
-    EXPECT_EQ(value, 42);
-    EXPECT_FALSE(inner.isCurrent());
+    EXPECT_NE(innerRanOn.get_future().get(), outerRanOn);
+    EXPECT_FALSE(outerCurrentInsideSync);
 }
 
 TEST(SerialQueue, SyncWaitsBehindQueuedWork) {
@@ -161,6 +206,8 @@ TEST_F(SerialQueueDeathTest, CodeThatMustRunOnAQueueAssertsElsewhere) {
     SerialQueue queue("affinity");
     EXPECT_DEATH(queue.assertCurrent(), "must run on this queue");
     EXPECT_DEATH(queue.sync([&] { queue.sync([] {}); }), "deadlock");
+    SerialQueue other("other");
+    EXPECT_DEATH(queue.sync([&] { other.sync([&] { queue.sync([] {}); }); }), "deadlock");
 }
 
 }  // namespace

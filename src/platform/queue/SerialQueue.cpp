@@ -11,7 +11,6 @@ namespace qm {
 
 namespace {
 
-thread_local const SerialQueue* currentQueue = nullptr;
 
 // Linux has no QoS classes; the nearest lever for a normal thread is its
 // nice value. Raising priority needs CAP_SYS_NICE: without it the thread
@@ -72,20 +71,11 @@ void SerialQueue::workerLoop() {
     }
 }
 
-const SerialQueue* SerialQueue::enterQueue() noexcept {
-    const SerialQueue* outer = currentQueue;
-    currentQueue = this;
-    return outer;
-}
-
-void SerialQueue::leaveQueue(const SerialQueue* outer) noexcept {
-    currentQueue = outer;
-}
+thread_local const SerialQueue::Running* SerialQueue::innermost_ = nullptr;
 
 void SerialQueue::runAsCurrent(const std::function<void()>& job) {
-    const SerialQueue* outer = enterQueue();
+    ScopedRunning running(this);
     job();
-    leaveQueue(outer);
 }
 
 bool SerialQueue::tryClaimIdle() {
@@ -121,7 +111,7 @@ void SerialQueue::enqueue(std::function<void()> job) {
 }
 
 void SerialQueue::sync(const std::function<void()>& job) {
-    assert(!isCurrent() && "sync() onto the queue already running: deadlock");
+    assert(!heldByThisThread() && "sync() onto a queue this thread already runs: deadlock");
     if (tryClaimIdle()) {
         runAsCurrent(job);
         releaseClaim();
@@ -141,7 +131,20 @@ void SerialQueue::sync(const std::function<void()>& job) {
 }
 
 bool SerialQueue::isCurrent() const noexcept {
-    return currentQueue == this;
+    return innermost_ != nullptr && innermost_->queue == this;
+}
+
+bool SerialQueue::heldByThisThread() const noexcept {
+    for (const auto* entry = innermost_; entry; entry = entry->outer) {
+        if (entry->queue == this) {
+            return true;
+        }
+    }
+    return false;
+}
+
+bool SerialQueue::runsOnAnyQueue() noexcept {
+    return innermost_ != nullptr;
 }
 
 void SerialQueue::assertCurrent() const noexcept {

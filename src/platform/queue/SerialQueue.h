@@ -4,14 +4,19 @@
 // not by locking; functions that must run there say so with assertCurrent().
 //
 // Each queue has one worker thread. A queue made with `runsInlineWhenIdle`
-// runs a submitted job directly on the submitting thread when nothing is
-// running or waiting on the queue (still one job at a time, and still "on"
-// the queue for isCurrent()); this saves two thread hops per request on the
-// daemon's hot path. Jobs submitted meanwhile wait for the worker.
+// runs an async() job directly on the submitting thread when nothing is
+// running or waiting on the queue and the submitting thread runs on no queue
+// at all (still one job at a time, and still "on" the queue for isCurrent());
+// this saves two thread hops per request on the daemon's hot path. Jobs
+// submitted meanwhile wait for the worker. A thread that already runs a job
+// never runs another queue's async job inline: X.sync -> Y.async -> X.sync
+// would otherwise find X held by the very thread that waits for it.
 //
-// sync() blocks the caller until its job has run. Calling sync() on the queue
-// one is already running on is a deadlock and asserts; by the daemon's lock
-// order nothing on the registry queue or syncQueue calls sync() on another queue.
+// sync() blocks the caller until its job has run; on an idle queue the job
+// runs on the caller's thread. Each thread keeps the stack of queues whose
+// jobs it is running, so sync() onto any queue the calling thread holds,
+// however deep, asserts instead of deadlocking. By the daemon's lock order
+// nothing on the registry queue or syncQueue calls sync() on another queue.
 
 #include <condition_variable>
 #include <deque>
@@ -43,7 +48,7 @@ public:
     // The job runs once; on an idle inline queue, before async() returns.
     template <class Job>
     void async(Job&& job) {
-        if (runsInlineWhenIdle_ && !isCurrent() && tryClaimIdle()) {
+        if (runsInlineWhenIdle_ && !runsOnAnyQueue() && tryClaimIdle()) {
             // No std::function (and no allocation) on the inline path.
             runInline(job);
             return;
@@ -53,8 +58,13 @@ public:
     // Blocks until the job has run on this queue.
     void sync(const std::function<void()>& job);
 
-    // True when the calling code runs as a job of this queue.
+    // True when the calling code runs as a job of this queue (the innermost
+    // queue of the calling thread).
     bool isCurrent() const noexcept;
+    // True when the calling thread runs a job of this queue at any depth.
+    bool heldByThisThread() const noexcept;
+    // True when the calling thread runs a job of any queue.
+    static bool runsOnAnyQueue() noexcept;
     void assertCurrent() const noexcept;
 
     // True while a job runs or waits.
@@ -65,15 +75,32 @@ private:
     void workerLoop();
     void enqueue(std::function<void()> job);
     void runAsCurrent(const std::function<void()>& job);
+    // Pushes this queue on the calling thread's stack of running queues for
+    // its scope; the entry lives in the frame that runs the job, so the stack
+    // costs no allocation.
+    struct Running {
+        const SerialQueue* queue;
+        const Running* outer;
+    };
+    class ScopedRunning {
+    public:
+        explicit ScopedRunning(const SerialQueue* queue) noexcept : entry_{queue, innermost_} { innermost_ = &entry_; }
+        ~ScopedRunning() { innermost_ = entry_.outer; }
+        ScopedRunning(const ScopedRunning&) = delete;
+        ScopedRunning& operator=(const ScopedRunning&) = delete;
+
+    private:
+        Running entry_;
+    };
     template <class Job>
     void runInline(Job& job) {
-        const SerialQueue* outer = enterQueue();
-        job();
-        leaveQueue(outer);
+        {
+            ScopedRunning running(this);
+            job();
+        }
         releaseClaim();
     }
-    const SerialQueue* enterQueue() noexcept;
-    void leaveQueue(const SerialQueue* outer) noexcept;
+    static thread_local const Running* innermost_;
     bool tryClaimIdle();           // takes the queue for the calling thread when idle
     void releaseClaim();
 
