@@ -4,7 +4,8 @@
 #include <condition_variable>
 #include <mutex>
 
-#include "client/WireKeys.h"
+#include "protocol/Packing.h"
+#include "protocol/WireKeys.h"
 #include "model/QMError.h"
 #include "platform/duct/ServiceSocket.h"
 #include "platform/log/SystemLog.h"
@@ -203,19 +204,9 @@ std::optional<qm::Error> QMDaemonClient::errorInReply(const qm::Result<qm::Value
 }
 
 std::optional<qm::Value> QMDaemonClient::convertToDuct(const qm::Value& propertyList, std::uint64_t version) {
-    if (version != wire::kCurrentVersion) {
-        return std::nullopt;
-    }
-    return qm::Value::packed(propertyList);
+    return wire::convertToDuct(propertyList, version);
 }
 
 std::optional<qm::Value> QMDaemonClient::convertFromDuct(const qm::Value& packed) const {
-    if (protocolVersion() != static_cast<std::int64_t>(wire::kCurrentVersion)) {
-        return std::nullopt;
-    }
-    const qm::Value* content = packed.packedContent();
-    if (!content) {
-        return std::nullopt;
-    }
-    return *content;
+    return wire::convertFromDuct(packed, static_cast<std::uint64_t>(protocolVersion()));
 }

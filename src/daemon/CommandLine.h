@@ -17,3 +17,7 @@ struct QMDOptions {
 std::optional<QMDOptions> parseCommandLine(int argc, char** argv);
 
 inline constexpr int kUsageExitStatus = 2;
+
+// `qmd --help` and `qmd --version`, as the only argument: prints and yields
+// exit status 0. Nothing for any other command line.
+std::optional<int> handleInformationalOption(int argc, char** argv);

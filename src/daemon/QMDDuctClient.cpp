@@ -4,6 +4,28 @@
 #include "daemon/Transaction.h"
 #include "platform/codesign/Entitlements.h"
 
+namespace {
+
+// A connection's "unexpected message" lines stop after this many; one line
+// with the count follows when it closes.
+constexpr unsigned kLoggedUnexpectedMessages = 10;
+
+ClientIdentity identityOf(const qm::duct::PeerConnection& connection) {
+    ClientIdentity identity;
+    identity.pid = connection.credentials().pid;
+    identity.uid = connection.credentials().uid;
+    identity.executablePath = connection.peerExecutablePath();
+    if (identity.executablePath) {
+        identity.bundle = QMBundle::initWithExecutablePath(*identity.executablePath);
+    }
+    if (identity.bundle) {
+        identity.entitlements = qm::readEntitlements(identity.bundle->directory());
+    }
+    return identity;
+}
+
+}  // namespace
+
 std::shared_ptr<QMDDuctClient> QMDDuctClient::initWithConnection(std::shared_ptr<qm::duct::PeerConnection> connection,
                                                                  QMDServer& server) {
     std::shared_ptr<QMDDuctClient> client(new QMDDuctClient(connection, server));
@@ -13,16 +35,9 @@ std::shared_ptr<QMDDuctClient> QMDDuctClient::initWithConnection(std::shared_ptr
     return client;
 }
 
-QMDDuctClient::QMDDuctClient(std::shared_ptr<qm::duct::PeerConnection> connection, QMDServer& server)
-    : connection_(connection), server_(server) {
-    auto executable = connection->peerExecutablePath();
-    if (executable) {
-        bundle_ = QMBundle::initWithExecutablePath(*executable);
-    }
-    server_.debug("client %d %s", connection->pid(), executable ? executable->c_str() : "");
-    if (bundle_) {
-        task_ = qm::readEntitlements(bundle_->directory());
-    }
+QMDDuctClient::QMDDuctClient(const std::shared_ptr<qm::duct::PeerConnection>& connection, QMDServer& server)
+    : connection_(connection), server_(server), identity_(identityOf(*connection)) {
+    server_.debug("client %d %s", identity_.pid, identity_.executablePath.value_or(""));
 }
 
 void QMDDuctClient::handleEvent(qm::duct::ConnectionEvent&& event) {
@@ -34,31 +49,49 @@ void QMDDuctClient::handleEvent(qm::duct::ConnectionEvent&& event) {
             if (event.reason != "peer hung up") {
                 server_.log("client %d: connection closed: %@", pid(), event.reason);
             }
+            if (unexpectedMessages_ > kLoggedUnexpectedMessages) {
+                server_.log("client %d sent %u unexpected messages, %u of them not logged", pid(), unexpectedMessages_,
+                            unexpectedMessages_ - kLoggedUnexpectedMessages);
+            }
             dead();
             return;
     }
 }
 
+void QMDDuctClient::logUnexpectedMessage(const qm::duct::IncomingMessage& message) {
+    if (++unexpectedMessages_ > kLoggedUnexpectedMessages) {
+        return;
+    }
+    auto connection = connection_.lock();
+    server_.log("unexpected message %@ on connection %@", message.body(),
+                connection ? connection->description() : std::string("(gone)"));
+}
+
 void QMDDuctClient::submitRequest(qm::duct::IncomingMessage&& message) {
     if (!message.body().isDictionary()) {
-        auto connection = connection_.lock();
-        server_.log("unexpected message %@ on connection %@", message.body(),
-                    connection ? connection->description() : std::string("(gone)"));
+        logUnexpectedMessage(message);
         return;
     }
     if (server_.verbose() >= 2) {
-        server_.debug("incoming request %@", message.body());
+        server_.logger().debugInFull("incoming request %@", message.body());
     }
     auto transaction = std::make_shared<Transaction>(std::move(message), shared_from_this());
-    server_.submitWork([transaction] {
-        QMDDuctClient& client = transaction->client();
-        client.server().mainQueue().assertCurrent();
-        client.requestCount += 1;
-        if (client.requestCount % 1000 == 0) {
-            client.server().debug("client %d used %u requests so far", client.pid(), client.requestCount);
-        }
-        transaction->dispatch();
-    });
+    bool mayRunInline = transaction->mayRunInline();
+    server_.submitWork(
+        [transaction] {
+            QMDDuctClient& client = transaction->client();
+            QMDServer& server = client.server();
+            server.mainQueue().assertCurrent();
+            if (server.stopping()) {
+                return;  // the daemon is going: queued transactions are dropped
+            }
+            client.requestCount += 1;
+            if (client.requestCount % 1000 == 0) {
+                server.debug("client %d used %u requests so far", client.pid(), client.requestCount);
+            }
+            transaction->dispatch();
+        },
+        mayRunInline);
 }
 
 void QMDDuctClient::dying() {
@@ -66,31 +99,11 @@ void QMDDuctClient::dying() {
 }
 
 void QMDDuctClient::dead() {
-    server_.unholdClient(*this);
-    server_.debug("client %d is dead", pid());
+    // In this order: a "lock" being served when the client dies either adds
+    // its hold before the release below, which removes it, or is refused.
     acceptWork_.store(false);
-}
-
-pid_t QMDDuctClient::pid() const {
-    auto connection = connection_.lock();
-    return connection ? connection->pid() : 0;
-}
-
-std::optional<qm::Value> QMDDuctClient::entitlementValueForKey(std::string_view key) const {
-    if (!task_) {
-        return std::nullopt;
-    }
-    const qm::Value* value = task_->get(key);
-    if (value == nullptr) {
-        return std::nullopt;
-    }
-    return *value;
-}
-
-bool QMDDuctClient::hasEntitlement(std::string_view key) const {
-    auto value = entitlementValueForKey(key);
-    // Boolean false, and so a number equal to it (0), is the only refusal.
-    return value && !(*value == qm::Value(false)) && !(value->isNumber() && *value == qm::Value(0));
+    server_.holds().unholdClient(weak_from_this(), pid());
+    server_.debug("client %d is dead", pid());
 }
 
 std::string QMDDuctClient::description() const {
@@ -98,6 +111,6 @@ std::string QMDDuctClient::description() const {
     if (!connection) {
         return qm::format("<QMDDuctClient %p NO CONNECTION>", static_cast<const void*>(this));
     }
-    return qm::format("<QMDDuctClient %p pid=%d con=%@>", static_cast<const void*>(this), connection->pid(),
+    return qm::format("<QMDDuctClient %p pid=%d con=%@>", static_cast<const void*>(this), pid(),
                       connection->description());
 }

@@ -1,84 +1,113 @@
 #include "daemon/QMDServer.h"
 
+#include <unistd.h>
+
 #include <chrono>
-#include <cstdlib>
 
 #include "daemon/QMDDuctClient.h"
 #include "platform/duct/OpenTransaction.h"
-#include "platform/env/Environment.h"
 
 namespace {
 
 // Never released while the process runs.
 std::atomic<QMDServer*> processServer{nullptr};
 
+// How long an ending daemon lets the running transaction write its reply.
+constexpr std::chrono::seconds kExitFlushLimit{5};
+
 }  // namespace
 
-qm::Result<QMDServer*> QMDServer::initForService(const std::string& serviceName,
-                                                 std::optional<std::string> databasePath) {
+qm::Result<QMDServer*> QMDServer::initForService(const std::string& serviceName, std::unique_ptr<QMDatabase> registry,
+                                                 std::optional<unsigned> idleExitSeconds) {
     auto loop = qm::EventLoop::create();
     if (!loop) {
         return loop.error();
     }
-    auto* server = new QMDServer(std::move(loop).value(), std::move(databasePath));
+    std::unique_ptr<QMDServer> server(new QMDServer(std::move(loop).value(), std::move(registry)));
     server->ductQueue_ = std::make_unique<qm::SerialQueue>("duct");
-    // Transactions run on the thread that read them whenever mainQueue is
-    // idle: a request then costs no thread hop at all.
+    // Transactions that block nothing run on the thread that read them
+    // whenever mainQueue is idle: such a request costs no thread hop at all.
     server->mainQueue_ =
         std::make_unique<qm::SerialQueue>("service", qm::QualityOfService::userInitiated, /*runsInlineWhenIdle=*/true);
-    server->syncQueue_ = std::make_unique<qm::SerialQueue>("serverSync");
     auto listener = qm::duct::Listener::create(*server->loop_, serviceName, *server->ductQueue_);
     if (!listener) {
-        // The half-built server has no clients or work yet; it can go.
-        delete server;
         return listener.error();
     }
     server->service_ = std::move(listener).value();
-    delete processServer.exchange(server);
-    server->service_->setConnectionHandler([server](std::shared_ptr<qm::duct::PeerConnection> connection) {
+    QMDServer* raw = server.get();
+    server->service_->setConnectionHandler([raw](std::shared_ptr<qm::duct::PeerConnection> connection) {
         // The client keeps itself alive through its connection.
-        QMDDuctClient::initWithConnection(std::move(connection), *server);
+        QMDDuctClient::initWithConnection(std::move(connection), *raw);
     });
-    if (auto seconds = qm::idleExitSeconds()) {
-        server->startIdleExitWatch(*seconds);
+    auto signals = qm::TerminationSignals::watch(*raw->loop_, [raw](const char* signalName) {
+        raw->exitInOrder(qm::format("exiting on %s", signalName));
+    });
+    if (!signals) {
+        return signals.error();
     }
-    return server;
+    raw->signals_ = std::move(signals).value();
+    if (idleExitSeconds) {
+        raw->startIdleExitWatch(*idleExitSeconds);
+    }
+    delete processServer.exchange(server.release());
+    return raw;
 }
 
 QMDServer* QMDServer::server() {
     return processServer.load();
 }
 
-QMDServer::QMDServer(std::unique_ptr<qm::EventLoop> loop, std::optional<std::string> databasePath)
-    : loop_(std::move(loop)), databasePath_(std::move(databasePath)) {}
+QMDServer::QMDServer(std::unique_ptr<qm::EventLoop> loop, std::unique_ptr<QMDatabase> registry)
+    : loop_(std::move(loop)), registry_(std::move(registry)), holds_(nullptr) {}
 
 void QMDServer::run() {
-    if (auto error = service_->resume()) {
-        log("cannot listen: %@", error->text());
-        return;
-    }
+    registry_->whenReady([this] { loop_->post([this] { resumeListener(); }); });
     loop_->run();
 }
 
-void QMDServer::unholdClient(const QMDDuctClient& /*client*/) {
-    // Holds are taken by the "lock" request; until it is served a client
-    // owns none, and there is nothing to release.
-    syncQueue_->sync([this] { syncQueue_->assertCurrent(); });
+void QMDServer::stop() {
+    loop_->stop();
+}
+
+void QMDServer::resumeListener() {
+    if (stopping()) {
+        return;
+    }
+    if (auto error = service_->resume()) {
+        exitInOrder(qm::format("cannot listen on %@: %@", service_->socketPath(), error->text()));
+        return;
+    }
+    debug("listening on %@", service_->socketPath());
 }
 
 void QMDServer::startIdleExitWatch(unsigned seconds) {
     auto idleSince = std::make_shared<std::chrono::steady_clock::time_point>(std::chrono::steady_clock::now());
     loop_->setTicker(std::chrono::milliseconds(250), [this, seconds, idleSince] {
         bool idle = qm::duct::openTransactionCount() == 0 && !mainQueue_->busy() && !ductQueue_->busy() &&
-                    !syncQueue_->busy();
+                    !syncQueue().busy();
         auto now = std::chrono::steady_clock::now();
         if (!idle) {
             *idleSince = now;
             return;
         }
         if (now - *idleSince >= std::chrono::seconds(seconds)) {
-            log("idle for %u seconds: exiting", seconds);
-            std::exit(0);
+            exitInOrder(qm::format("idle for %u seconds: exiting", seconds));
         }
+    });
+}
+
+void QMDServer::exitInOrder(std::string line) {
+    if (stopping_.exchange(true)) {
+        return;
+    }
+    service_->stop();
+    auto deadline = std::chrono::steady_clock::now() + kExitFlushLimit;
+    loop_->setTicker(std::chrono::milliseconds(10), [this, deadline, line = std::move(line)] {
+        if (mainQueue_->busy() && std::chrono::steady_clock::now() < deadline) {
+            return;
+        }
+        service_->unlinkOwnSocket();
+        log("%@", line);
+        ::_exit(0);
     });
 }

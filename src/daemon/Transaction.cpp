@@ -3,40 +3,22 @@
 #include <cassert>
 #include <string_view>
 
-#include "client/WireKeys.h"
 #include "daemon/QMDDuctClient.h"
 #include "daemon/QMDServer.h"
+#include "daemon/Routes.h"
 #include "model/QMError.h"
+#include "protocol/WireKeys.h"
 
 namespace {
 
-using Handler = void (Transaction::*)();
+const std::string* requestName(const qm::Value& request) {
+    const qm::Value* value = request.get(wire::kRequest);
+    return value ? value->asString() : nullptr;
+}
 
-struct Route {
-    std::string_view name;
-    Handler handler;  // null until the request is served
-};
-
-// Compared byte for byte, in this order. A request whose handler does not
-// exist yet is answered like an unknown one.
-constexpr Route kRoutes[] = {
-    {"add", nullptr},
-    {"remove", nullptr},
-    {"bulk", &Transaction::bulkPlugIns},
-    {"match", nullptr},
-    {"ready", nullptr},
-    {"access", nullptr},
-    {"annotate", nullptr},
-    {"lock", nullptr},
-};
-
-Handler handlerFor(std::string_view name) {
-    for (const Route& route : kRoutes) {
-        if (route.name == name) {
-            return route.handler;
-        }
-    }
-    return nullptr;
+std::uint64_t requestVersion(const qm::Value& request) {
+    const qm::Value* value = request.get(wire::kVersion);
+    return value ? value->asUnsigned().value_or(0) : 0;
 }
 
 }  // namespace
@@ -48,14 +30,21 @@ QMDServer& Transaction::server() const noexcept {
     return client_->server();
 }
 
+bool Transaction::mayRunInline() const {
+    if (!wire::isSupportedVersion(requestVersion(request()))) {
+        return true;
+    }
+    const std::string* name = requestName(request());
+    const Route* route = name ? routeFor(*name) : nullptr;
+    return route == nullptr || route->runsInline;
+}
+
 void Transaction::dispatch() {
     server().mainQueue().assertCurrent();
-    const qm::Value* nameValue = request().get(wire::kRequest);
-    const std::string* name = nameValue ? nameValue->asString() : nullptr;
-    const qm::Value* versionValue = request().get(wire::kVersion);
-    version_ = versionValue ? versionValue->asUnsigned().value_or(0) : 0;
+    const std::string* name = requestName(request());
+    version_ = requestVersion(request());
 
-    if (version_ != wire::kOldestVersion && version_ != wire::kCurrentVersion) {
+    if (!wire::isSupportedVersion(version_)) {
         fail(kQMErrorVersion, qm::format("unsupported protocol version %d (current %d)",
                                          static_cast<std::int32_t>(static_cast<std::uint32_t>(version_)),
                                          static_cast<int>(wire::kCurrentVersion)));
@@ -64,19 +53,28 @@ void Transaction::dispatch() {
     if (!client_->acceptWork()) {
         return;  // the client is dead: no handler, no reply
     }
-    if (server().verbose() != 0) {  // the pid costs a lookup: only when the line is written
-        server().debug("client %d request %s", client_->pid(), name ? name->c_str() : nullptr);
-    }
+    server().debug("client %d request %s", client_->pid(), name ? name->c_str() : nullptr);
     if (name == nullptr) {
         fail(kQMErrorInvalidRequest, std::string("invalid request format (missing type)"));
         return;
     }
-    Handler handler = handlerFor(*name);
-    if (handler == nullptr) {
+    const Route* route = routeFor(*name);
+    if (route == nullptr) {
         fail(kQMErrorInvalidRequest, std::string("unrecognized request"));
         return;
     }
-    (this->*handler)();
+    RequestContext context{server().registry(), server().holds(), server().logger(), client_->identity(),
+                           client_,           request(),       version_};
+    finish(route->handler(context));
+}
+
+void Transaction::finish(Reply reply) {
+    reply_ = std::move(reply.values);
+    if (reply.failure) {
+        fail(reply.failure->code, std::move(reply.failure->message));
+        return;
+    }
+    done();
 }
 
 void Transaction::done() {
@@ -84,7 +82,7 @@ void Transaction::done() {
     finished_ = true;
     qm::Value reply(std::move(reply_));
     if (server().verbose() >= 2) {
-        server().debug("Replying %@", reply);
+        server().logger().debugInFull("Replying %@", reply);
     }
     request_.reply(reply);
 }
@@ -95,12 +93,4 @@ void Transaction::fail(int code, std::optional<std::string> message) {
         reply_.set(wire::kError, qm::Value(std::move(*message)));
     }
     done();
-}
-
-void Transaction::fail(int code, const qm::Error& error) {
-    if (error.domain == kQuamberErrorDomain) {
-        fail(static_cast<int>(error.code), error.description);
-        return;
-    }
-    fail(code, error.description);
 }

@@ -8,7 +8,7 @@
 #include "Command.h"
 #include "DaemonSession.h"
 #include "ReplyFormat.h"
-#include "client/WireKeys.h"
+#include "protocol/WireKeys.h"
 #include "platform/value/Json.h"
 
 namespace {

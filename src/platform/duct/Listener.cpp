@@ -1,10 +1,12 @@
 #include "platform/duct/Listener.h"
 
 #include <sys/socket.h>
+#include <sys/un.h>
 
 #include <fcntl.h>
 
 #include <cerrno>
+#include <cstddef>
 #include <cstring>
 
 #include "platform/env/Environment.h"
@@ -23,6 +25,16 @@ bool isListeningStreamSocket(int fd) {
     socklen_t typeLength = sizeof type;
     return ::getsockopt(fd, SOL_SOCKET, SO_ACCEPTCONN, &accepting, &length) == 0 && accepting &&
            ::getsockopt(fd, SOL_SOCKET, SO_TYPE, &type, &typeLength) == 0 && type == SOCK_STREAM;
+}
+
+std::string boundPath(int fd) {
+    sockaddr_un address{};
+    socklen_t length = sizeof address;
+    if (::getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length) != 0 || address.sun_family != AF_UNIX ||
+        length <= offsetof(sockaddr_un, sun_path)) {
+        return {};
+    }
+    return std::string(address.sun_path, ::strnlen(address.sun_path, length - offsetof(sockaddr_un, sun_path)));
 }
 
 }  // namespace
@@ -44,19 +56,22 @@ Result<std::shared_ptr<Listener>> Listener::create(EventLoop& loop, const std::s
         int flags = ::fcntl(socket.get(), F_GETFL);
         ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK);
         ::fcntl(socket.get(), F_SETFD, FD_CLOEXEC);
-        return std::shared_ptr<Listener>(new Listener(loop, serviceName, eventQueue, std::move(socket), UniqueFd()));
+        std::string path = boundPath(socket.get());
+        return std::shared_ptr<Listener>(
+            new Listener(loop, serviceName, eventQueue, std::move(socket), UniqueFd(), std::move(path), false));
     }
     auto claimed = openServiceSocket(serviceName);
     if (!claimed) {
         return claimed.error();
     }
     return std::shared_ptr<Listener>(new Listener(loop, serviceName, eventQueue, std::move(claimed->listener),
-                                                  std::move(claimed->lock)));
+                                                  std::move(claimed->lock), std::move(claimed->path), true));
 }
 
-Listener::Listener(EventLoop& loop, std::string serviceName, SerialQueue& eventQueue, UniqueFd socket, UniqueFd lock)
+Listener::Listener(EventLoop& loop, std::string serviceName, SerialQueue& eventQueue, UniqueFd socket, UniqueFd lock,
+                   std::string socketPath, bool boundHere)
     : loop_(loop), serviceName_(std::move(serviceName)), eventQueue_(eventQueue), socket_(std::move(socket)),
-      lock_(std::move(lock)) {}
+      lock_(std::move(lock)), socketPath_(std::move(socketPath)), boundHere_(boundHere) {}
 
 Listener::~Listener() = default;
 
@@ -122,11 +137,25 @@ void Listener::pauseAccepting() {
 }
 
 void Listener::resumeAccepting() {
-    if (!paused_) {
+    if (!paused_ || !registered_) {
         return;
     }
     paused_ = false;
     (void)loop_.modify(registration_, socket_.get(), EPOLLIN);
+}
+
+void Listener::stop() {
+    if (registered_) {
+        loop_.remove(registration_, socket_.get());
+        registered_ = false;
+    }
+    paused_ = true;
+}
+
+void Listener::unlinkOwnSocket() {
+    if (boundHere_) {
+        ::unlink(socketPath_.c_str());
+    }
 }
 
 }  // namespace qm::duct

@@ -31,12 +31,21 @@ public:
 
     void setConnectionHandler(ConnectionHandler handler);  // before resume()
     MaybeError resume();
+    // Stops accepting for good (loop thread); peers that connect later wait
+    // in the backlog until the socket closes.
+    void stop();
     const std::string& serviceName() const noexcept { return serviceName_; }
+    // Where the socket lies (for a passed socket, what the kernel reports).
+    const std::string& socketPath() const noexcept { return socketPath_; }
+    // Removes the socket file, only when this process bound it: a socket
+    // passed by the service manager stays for the next activation.
+    void unlinkOwnSocket();
 
     void handleEvents(std::uint32_t events) override;
 
 private:
-    Listener(EventLoop& loop, std::string serviceName, SerialQueue& eventQueue, UniqueFd socket, UniqueFd lock);
+    Listener(EventLoop& loop, std::string serviceName, SerialQueue& eventQueue, UniqueFd socket, UniqueFd lock,
+             std::string socketPath, bool boundHere);
     void acceptPending();
     void pauseAccepting();
     void resumeAccepting();
@@ -46,6 +55,8 @@ private:
     SerialQueue& eventQueue_;
     UniqueFd socket_;
     UniqueFd lock_;
+    const std::string socketPath_;
+    const bool boundHere_;
     ConnectionHandler handler_;
     EventLoop::RegistrationId registration_ = 0;
     bool registered_ = false;

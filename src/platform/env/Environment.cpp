@@ -73,16 +73,19 @@ std::string ductRuntimeDirectory() {
     return "/tmp/ovaro-" + std::to_string(::getuid());
 }
 
-std::optional<unsigned> idleExitSeconds() {
+Result<std::optional<unsigned>> idleExitSeconds() {
     auto v = variable("QM_IDLE_EXIT");
     if (!v) {
-        return std::nullopt;
+        return std::optional<unsigned>();
     }
-    auto n = positiveNumber(*v);
-    if (!n || *n > 1000000000UL) {
-        return std::nullopt;
+    constexpr unsigned kMostSeconds = 1'000'000'000;  // about 31 years
+    bool digitsOnly = v->find_first_not_of("0123456789") == std::string::npos && v->size() <= 10;
+    unsigned long long seconds = digitsOnly ? std::stoull(*v) : 0;
+    if (seconds == 0 || seconds > kMostSeconds) {
+        return Error{"environment", EINVAL,
+                     "QM_IDLE_EXIT must be a whole number of seconds from 1 to 1000000000, not \"" + *v + "\""};
     }
-    return static_cast<unsigned>(*n);
+    return std::optional<unsigned>(static_cast<unsigned>(seconds));
 }
 
 std::vector<int> takeSocketActivationDescriptors() {

@@ -7,6 +7,8 @@
 #include <string>
 #include <vector>
 
+#include "platform/error/Error.h"
+
 namespace qm {
 
 struct ProcessEnvironment {
@@ -19,8 +21,9 @@ const ProcessEnvironment& environment();
 std::string ductRuntimeDirectory();
 
 // QM_IDLE_EXIT: seconds without clients, holds or work before the daemon
-// exits; nothing when unset or not a positive number.
-std::optional<unsigned> idleExitSeconds();
+// exits; nothing when unset or empty; an error naming the variable for
+// anything but a positive decimal number.
+Result<std::optional<unsigned>> idleExitSeconds();
 
 // Descriptors passed by systemd socket activation (LISTEN_FDS, for this
 // process per LISTEN_PID). Clears the variables so children do not inherit them.

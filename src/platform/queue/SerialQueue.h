@@ -55,6 +55,12 @@ public:
         }
         enqueue(std::function<void()>(std::forward<Job>(job)));
     }
+    // The job runs once, on the worker thread, never on the caller's: for
+    // jobs that may block, submitted from a thread that must not.
+    template <class Job>
+    void asyncOnWorker(Job&& job) {
+        enqueue(std::function<void()>(std::forward<Job>(job)));
+    }
     // Blocks until the job has run on this queue.
     void sync(const std::function<void()>& job);
 

@@ -3,6 +3,8 @@
 #include <cinttypes>
 #include <cstdio>
 
+#include "platform/value/Utf8.h"
+
 namespace qm {
 
 namespace {
@@ -152,6 +154,50 @@ std::string formatArgs(std::string_view format, const std::vector<FormatArg>& ar
         i = j;
     }
     return out;
+}
+
+namespace {
+
+// The longest prefix of text within limit bytes that ends on a character boundary.
+std::size_t characterBoundaryWithin(std::string_view text, std::size_t limit) {
+    std::size_t end = 0;
+    while (end < text.size()) {
+        std::size_t length = utf8::sequenceLength(text.substr(end));
+        length = length == 0 ? 1 : length;  // a stray byte is cut like a character
+        if (end + length > limit) {
+            break;
+        }
+        end += length;
+    }
+    return end;
+}
+
+}  // namespace
+
+void boundTextArgs(std::vector<FormatArg>& args) {
+    for (FormatArg& arg : args) {
+        if (arg.kind != FormatArg::Kind::Text || arg.text.size() <= kMaxLoggedArgument) {
+            continue;
+        }
+        std::size_t whole = arg.text.size();
+        arg.text.resize(characterBoundaryWithin(arg.text, kMaxLoggedArgument));
+        arg.text += "…[" + std::to_string(whole) + " bytes]";
+    }
+}
+
+std::vector<std::string> splitForLog(std::string_view text) {
+    static constexpr std::string_view kContinuation = "… ";
+    std::vector<std::string> lines;
+    std::size_t end = characterBoundaryWithin(text, kMaxLoggedArgument);
+    lines.emplace_back(text.substr(0, end));
+    text.remove_prefix(end);
+    while (!text.empty()) {
+        end = characterBoundaryWithin(text, kMaxLoggedArgument - kContinuation.size());
+        end = end == 0 ? 1 : end;
+        lines.emplace_back(kContinuation).append(text.substr(0, end));
+        text.remove_prefix(end);
+    }
+    return lines;
 }
 
 }  // namespace qm

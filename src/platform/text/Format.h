@@ -89,4 +89,21 @@ std::string format(std::string_view fmt, const Args&... args) {
     return formatArgs(fmt, std::vector<FormatArg>{makeFormatArg(args)...});
 }
 
+// Log lines bound what a peer can make them carry: a text argument longer
+// than this is cut (at a character boundary) and marked "…[N bytes]" with
+// its whole size. Replies are never cut; only log lines.
+inline constexpr std::size_t kMaxLoggedArgument = 1024;
+void boundTextArgs(std::vector<FormatArg>& args);
+
+template <class... Args>
+std::string boundedFormat(std::string_view fmt, const Args&... args) {
+    std::vector<FormatArg> bound{makeFormatArg(args)...};
+    boundTextArgs(bound);
+    return formatArgs(fmt, bound);
+}
+
+// A text logged in full, as lines of at most kMaxLoggedArgument bytes cut at
+// character boundaries; every line after the first starts with "… ".
+std::vector<std::string> splitForLog(std::string_view text);
+
 }  // namespace qm

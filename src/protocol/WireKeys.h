@@ -1,5 +1,6 @@
 #pragma once
-// The keys of the request and reply dictionaries, and the protocol versions.
+// The keys of the request and reply dictionaries, the protocol versions and
+// the default service name: what the daemon and its clients agree on.
 
 #include <cstdint>
 
@@ -20,6 +21,10 @@ inline constexpr const char* kExtensions = "extensions";
 
 inline constexpr std::uint64_t kCurrentVersion = 3;
 inline constexpr std::uint64_t kOldestVersion = 2;
+
+inline bool isSupportedVersion(std::uint64_t version) noexcept {
+    return version == kOldestVersion || version == kCurrentVersion;
+}
 
 inline constexpr const char* kDefaultServiceName = "ovaro.quamber.qmd";
 
