@@ -9,6 +9,7 @@
 
 #include <gtest/gtest.h>
 
+#include <csignal>
 #include <cstring>
 #include <thread>
 
@@ -44,19 +45,58 @@ TEST(Startup, BadCommandLinesPrintTheUsageAndExitTwo) {
     EXPECT_EQ(std::string(kUsage).size(), 33u);
 }
 
-TEST(Startup, AServiceNameItCannotClaimEndsTheDaemonWithStatusOne) {
+TEST(Startup, InformationalOptionsPrintAndExitZero) {
+    auto version = runProgram({QMD_BINARY_PATH, "--version"});
+    EXPECT_EQ(version.exitStatus, 0);
+    EXPECT_EQ(version.out, std::string("qmd ") + QM_VERSION + "\n");
+    auto help = runProgram({QMD_BINARY_PATH, "--help"});
+    EXPECT_EQ(help.exitStatus, 0);
+    EXPECT_NE(help.out.find("-S name"), std::string::npos) << help.out;
+    EXPECT_EQ(runProgram({QMD_BINARY_PATH, "--version", "-v"}).exitStatus, 2) << "only as the only argument";
+}
+
+// Every refusal at start names its cause on standard error (no QM_LOG_STDERR
+// here) and exits 1; a runtime directory is refused, never changed.
+TEST(Startup, RefusalsAtStartNameTheirCauseAndChangeNothing) {
     qmtest::TempDir dir;
-    std::map<std::string, std::string> env = {{"QM_DUCT_DIR", dir.file("duct")}, {"QM_LOG_STDERR", "1"}};
-    for (const char* name : {"", "a/b"}) {
-        auto result = runProgram({QMD_BINARY_PATH, "-S", name}, env);
-        EXPECT_EQ(result.exitStatus, 1) << name;
+    qmtest::writeFile(dir.file("notadir"), "x");
+    for (mode_t mode : {0755, 01777, 0710}) {
+        std::string path = dir.file("mode" + std::to_string(mode));
+        ASSERT_EQ(::mkdir(path.c_str(), 0700), 0);
+        ASSERT_EQ(::chmod(path.c_str(), mode), 0);
+    }
+    struct Case {
+        std::vector<std::string> arguments;
+        std::map<std::string, std::string> environment;
+        std::string says;
+    };
+    std::string duct = dir.file("duct");
+    const Case cases[] = {
+        {{"-S", ""}, {{"QM_DUCT_DIR", duct}}, "invalid service name"},
+        {{"-S", "a/b"}, {{"QM_DUCT_DIR", duct}}, "invalid service name"},
+        {{}, {{"QM_DUCT_DIR", dir.file("notadir")}}, "is not a directory"},
+        {{}, {{"QM_DUCT_DIR", dir.file("mode493")}}, dir.file("mode493") + " has mode 0755"},
+        {{}, {{"QM_DUCT_DIR", dir.file("mode1023")}}, dir.file("mode1023") + " has mode 1777"},
+        {{}, {{"QM_DUCT_DIR", dir.file("mode456")}}, "has mode 0710"},
+        {{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", "abc"}}, "QM_IDLE_EXIT"},
+        {{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", "0"}}, "QM_IDLE_EXIT"},
+        {{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", "-5"}}, "QM_IDLE_EXIT"},
+        {{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", " 5"}}, "QM_IDLE_EXIT"},
+        {{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", "99999999999"}}, "QM_IDLE_EXIT"},
+    };
+    for (const Case& c : cases) {
+        std::vector<std::string> argv{QMD_BINARY_PATH};
+        argv.insert(argv.end(), c.arguments.begin(), c.arguments.end());
+        auto result = runProgram(argv, c.environment);
+        EXPECT_EQ(result.exitStatus, 1) << c.says;
+        EXPECT_NE(result.err.find(c.says), std::string::npos) << result.err;
         EXPECT_NE(result.err.find("unable to construct server"), std::string::npos) << result.err;
     }
-    // A runtime directory that is a file cannot be used.
-    qmtest::writeFile(dir.file("notadir"), "x");
-    auto result = runProgram({QMD_BINARY_PATH}, {{"QM_DUCT_DIR", dir.file("notadir")}, {"QM_LOG_STDERR", "1"}});
-    EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_NE(result.err.find("is not a directory"), std::string::npos) << result.err;
+    for (mode_t mode : {0755, 01777, 0710}) {
+        struct stat info{};
+        ASSERT_EQ(::stat(dir.file("mode" + std::to_string(mode)).c_str(), &info), 0);
+        EXPECT_EQ(info.st_mode & 07777, mode) << "the runtime directory was changed";
+    }
 }
 
 TEST(Startup, TheRuntimeDirectoryAndSocketArePrivate) {
@@ -75,7 +115,7 @@ TEST(Startup, ASecondDaemonOnTheSameNameLeavesTheFirstAlone) {
     auto result = runProgram({QMD_BINARY_PATH, "-S", first.serviceName()},
                              {{"QM_DUCT_DIR", first.runtimeDirectory()}, {"QM_LOG_STDERR", "1"}});
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_NE(result.err.find("service already running"), std::string::npos) << result.err;
+    EXPECT_NE(result.err.find("service already running on " + first.socketPath()), std::string::npos) << result.err;
     RawClient client(first.socketPath());
     EXPECT_TRUE(client.roundTrip(bulk()));
 }
@@ -129,6 +169,28 @@ TEST(Startup, ASocketPassedByTheServiceManagerIsUsed) {
     ::waitpid(pid, nullptr, 0);
 }
 
+// The daemon ends in order: exit 0, one line, its own socket removed.
+void expectOrderlyExit(DaemonProcess& daemon, const std::string& line) {
+    auto status = daemon.waitForExit(std::chrono::seconds(10));
+    ASSERT_TRUE(status);
+    EXPECT_TRUE(WIFEXITED(*status));
+    EXPECT_EQ(WEXITSTATUS(*status), 0);
+    EXPECT_NE(daemon.log().find(line), std::string::npos) << daemon.log();
+    struct stat info{};
+    EXPECT_NE(::stat(daemon.socketPath().c_str(), &info), 0) << "socket left behind";
+}
+
+TEST(Startup, TerminationSignalsEndTheDaemonInOrder) {
+    for (auto [signal, name] : {std::pair{SIGTERM, "SIGTERM"}, std::pair{SIGINT, "SIGINT"}}) {
+        DaemonProcess daemon(qmtest::withArguments({"-v"}));
+        EXPECT_TRUE(daemon.waitForLog("listening on " + daemon.socketPath()));
+        RawClient client(daemon.socketPath());
+        ASSERT_TRUE(client.roundTrip(bulk()));
+        ::kill(daemon.pid(), signal);
+        expectOrderlyExit(daemon, std::string("exiting on ") + name);
+    }
+}
+
 TEST(Startup, AnIdleDaemonExitsButNotUnderAConnectedClient) {
     DaemonProcess daemon(qmtest::withEnvironment({{"QM_IDLE_EXIT", "1"}}));
     {
@@ -138,10 +200,7 @@ TEST(Startup, AnIdleDaemonExitsButNotUnderAConnectedClient) {
         EXPECT_TRUE(daemon.running());
         EXPECT_TRUE(client.roundTrip(bulk()));
     }
-    auto status = daemon.waitForExit(std::chrono::seconds(5));
-    ASSERT_TRUE(status);
-    EXPECT_TRUE(WIFEXITED(*status));
-    EXPECT_EQ(WEXITSTATUS(*status), 0);
+    expectOrderlyExit(daemon, "idle for 1 seconds: exiting");
 }
 
 }  // namespace

@@ -46,6 +46,13 @@ Result<std::shared_ptr<Listener>> Listener::create(EventLoop& loop, const std::s
     }
     auto activated = takeSocketActivationDescriptors();
     if (!activated.empty()) {
+        // The service manager made the folder; it must still be ours alone.
+        if (auto directory = prepareRuntimeDirectory(); !directory) {
+            for (int fd : activated) {
+                ::close(fd);
+            }
+            return directory.error();
+        }
         UniqueFd socket(activated.front());
         for (std::size_t i = 1; i < activated.size(); ++i) {
             ::close(activated[i]);  // one service, one socket

@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
 
 #include "platform/env/Environment.h"
@@ -30,13 +31,31 @@ Result<sockaddr_un> socketAddress(const std::string& path) {
     return address;
 }
 
-// True when something accepts connections on the path.
+// True when something accepts connections on the path. Never blocks: a
+// daemon whose backlog is full (EAGAIN) is running all the same.
 bool serviceAnswers(const sockaddr_un& address) {
-    UniqueFd probe(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    UniqueFd probe(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     if (!probe) {
         return false;
     }
-    return ::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+    return ::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0 ||
+           errno == EAGAIN;
+}
+
+// The runtime directory is never changed, only refused: pointed at a shared
+// folder by mistake, the daemon must not make it private.
+MaybeError checkRuntimeDirectory(const std::string& directory, const struct stat& info) {
+    if (!S_ISDIR(info.st_mode)) {
+        return ductError(ENOTDIR, "runtime directory " + directory + " is not a directory");
+    }
+    if (info.st_uid != ::geteuid() || (info.st_mode & 07077) != 0) {
+        char mode[8];
+        std::snprintf(mode, sizeof mode, "%04o", static_cast<unsigned>(info.st_mode & 07777));
+        return ductError(EPERM, "runtime directory " + directory + " has mode " + mode + " and owner uid " +
+                                    std::to_string(info.st_uid) + ": it must be owned by uid " +
+                                    std::to_string(::geteuid()) + " with mode 0700");
+    }
+    return std::nullopt;
 }
 
 }  // namespace
@@ -57,14 +76,8 @@ Result<std::string> prepareRuntimeDirectory() {
     if (::lstat(directory.c_str(), &info) != 0) {
         return posixError(errno, "cannot examine runtime directory " + directory);
     }
-    if (!S_ISDIR(info.st_mode)) {
-        return ductError(ENOTDIR, "runtime directory " + directory + " is not a directory");
-    }
-    if (info.st_uid != ::geteuid()) {
-        return ductError(EPERM, "runtime directory " + directory + " is not owned by this user");
-    }
-    if ((info.st_mode & 0077) != 0 && ::chmod(directory.c_str(), 0700) != 0) {
-        return posixError(errno, "cannot restrict runtime directory " + directory);
+    if (auto refused = checkRuntimeDirectory(directory, info)) {
+        return *refused;
     }
     return directory;
 }
@@ -89,11 +102,8 @@ Result<ClaimedServiceSocket> openServiceSocket(const std::string& serviceName) {
     if (!lock) {
         return posixError(errno, "cannot open " + lockPath);
     }
-    if (::flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
-        return ductError(EADDRINUSE, "service already running");
-    }
-    if (serviceAnswers(*address)) {
-        return ductError(EADDRINUSE, "service already running");
+    if (::flock(lock.get(), LOCK_EX | LOCK_NB) != 0 || serviceAnswers(*address)) {
+        return ductError(EADDRINUSE, "service already running on " + *path);
     }
     ::unlink(path->c_str());  // a stale socket: nobody answered
 

@@ -3,10 +3,12 @@
 // runtime directory.
 //
 // Start-up rules: a service name that is empty or holds "/" is refused. The
-// runtime directory must be a directory owned by this user; it is created
-// with mode 0700 when missing. An existing socket file is probed with a
-// connect: when a daemon answers, start-up fails ("service already running");
-// otherwise the stale file is replaced. The socket is created with mode 0600.
+// runtime directory must be a directory owned by this user with no group or
+// other permission; it is created with mode 0700 when missing, and refused,
+// never changed, otherwise. An existing socket file is probed with a
+// non-blocking connect: when a daemon answers, start-up fails ("service
+// already running on PATH"); otherwise the stale file is replaced. The socket
+// is created with mode 0600.
 
 #include <string>
 
@@ -20,7 +22,8 @@ inline constexpr const char* kDuctErrorDomain = "duct";
 // The path of a service's socket, after checking the name (no I/O).
 Result<std::string> serviceSocketPath(const std::string& serviceName);
 
-// Creates (or checks) the runtime directory with mode 0700; returns its path.
+// Creates the runtime directory with mode 0700, or checks the one that
+// exists; returns its path.
 Result<std::string> prepareRuntimeDirectory();
 
 struct ClaimedServiceSocket {
