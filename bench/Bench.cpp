@@ -1,6 +1,7 @@
 #include "Bench.h"
 
 #include <sched.h>
+#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -29,6 +30,12 @@ struct BenchRequest {
     qm::Value message;
     // True when qmd's reply is the one this path must produce.
     bool (*replyIsExpected)(const qm::Value& reply);
+};
+
+// Heap allocations qmd makes per request, all threads included.
+struct AllocationRow {
+    std::string request;
+    double perRequest = 0;
 };
 
 struct Row {
@@ -78,7 +85,7 @@ bool waitForSocket(const std::string& path, ChildProcess& server) {
     return false;
 }
 
-ChildProcess startDaemon(const std::string& scratch) {
+ChildProcess startDaemon(const std::string& scratch, std::map<std::string, std::string> extraEnvironment = {}) {
     std::map<std::string, std::string> environment = {
         {"PATH", "/usr/bin:/bin"},
         {"HOME", scratch},
@@ -89,6 +96,7 @@ ChildProcess startDaemon(const std::string& scratch) {
         {"QM_SYSTEM_ROOTS", scratch + "/roots"},
         {"QM_SDK_PATH", scratch + "/sdks"},
     };
+    environment.merge(extraEnvironment);
     return ChildProcess::exec({QMD_BINARY_PATH, "-S", kServiceName}, environment, scratch + "/qmd.log");
 }
 
@@ -146,6 +154,60 @@ bool measureMode(bool pinned, const std::string& scratch, std::chrono::milliseco
     return true;
 }
 
+#ifdef QM_ALLOC_COUNTER_PATH
+// The preloaded counter's total so far, after asking qmd for it.
+std::optional<unsigned long long> allocationCount(ChildProcess& daemon, const std::string& countFile) {
+    std::filesystem::remove(countFile);
+    ::kill(daemon.pid(), SIGUSR2);
+    for (int i = 0; i < 200; ++i) {
+        if (std::FILE* file = std::fopen(countFile.c_str(), "r")) {
+            unsigned long long count = 0;
+            bool read = std::fscanf(file, "%llu", &count) == 1;
+            std::fclose(file);
+            if (read) {
+                return count;
+            }
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+    return std::nullopt;
+}
+
+// Allocations per request, from the counter preloaded into a qmd of its own;
+// one blocking client, after a warm-up, so that only the request path counts.
+bool measureAllocations(const std::string& scratch, std::vector<AllocationRow>& rows) {
+    std::string countFile = scratch + "/allocations";
+    ChildProcess daemon =
+        startDaemon(scratch, {{"LD_PRELOAD", QM_ALLOC_COUNTER_PATH}, {"QM_ALLOCATION_COUNT_FILE", countFile}});
+    std::string path = scratch + "/duct/" + kServiceName;
+    if (!waitForSocket(path, daemon)) {
+        std::fputs("qmd_bench: qmd with the allocation counter did not start\n", stderr);
+        return false;
+    }
+    constexpr int kWarmUp = 1000;
+    constexpr int kCounted = 20000;
+    for (const BenchRequest& request : benchRequests()) {
+        qm::Bytes frame = *qm::duct::encodeFrame(qm::duct::FrameKind::message, 1, request.message);
+        auto client = RoundTripClient::connect(path);
+        for (int i = 0; client && i < kWarmUp; ++i) {
+            client->roundTrip(frame);
+        }
+        auto before = allocationCount(daemon, countFile);
+        bool ok = client && before;
+        for (int i = 0; ok && i < kCounted; ++i) {
+            ok = client->roundTrip(frame) != nullptr;
+        }
+        auto after = allocationCount(daemon, countFile);
+        if (!ok || !after) {
+            std::fprintf(stderr, "qmd_bench: counting allocations of %s failed\n", request.label);
+            return false;
+        }
+        rows.push_back({request.label, static_cast<double>(*after - *before) / kCounted});
+    }
+    return true;
+}
+#endif
+
 // Mean time per round trip, qmd over echo.
 double timeRatio(const Row& row) {
     return row.echo.roundTripsPerSecond / row.qmd.roundTripsPerSecond;
@@ -153,6 +215,29 @@ double timeRatio(const Row& row) {
 
 double p50Ratio(const Row& row) {
     return row.qmd.p50Micros / row.echo.p50Micros;
+}
+
+void printAllocations(const std::vector<AllocationRow>& rows) {
+    if (rows.empty()) {
+        std::printf("\nallocations per request: not measured (sanitized build)\n");
+        return;
+    }
+    std::printf("\nheap allocations per request in qmd (all threads, one client):");
+    for (const AllocationRow& row : rows) {
+        std::printf("  %s %.1f", row.request.c_str(), row.perRequest);
+    }
+    std::printf("\n");
+}
+
+// Whether the run paid for log lines: syslog(3) is skipped while no log
+// daemon listens on /dev/log, and "bulk" logs one line per request.
+void printLogNote() {
+    struct stat info{};
+    if (::stat("/dev/log", &info) == 0) {
+        std::printf("log lines: written to the system log (/dev/log present); \"bulk\" paid for one per request\n");
+    } else {
+        std::printf("log lines: skipped, no log daemon listens on /dev/log; \"bulk\" would write one per request\n");
+    }
 }
 
 void printTable(const std::vector<Row>& rows, double seconds) {
@@ -198,10 +283,16 @@ int runBench(const BenchOptions& options) {
 
     auto duration = std::chrono::milliseconds(static_cast<long long>(options.secondsPerFigure * 1000));
     std::vector<Row> rows;
+    std::vector<AllocationRow> allocations;
     bool ok = setAffinity(cpuZero) && measureMode(true, scratch, duration, rows);
     ok = ok && setAffinity(everywhere) && measureMode(false, scratch, duration, rows);
+#ifdef QM_ALLOC_COUNTER_PATH
+    ok = ok && measureAllocations(scratch, allocations);
+#endif
     if (ok) {
         printTable(rows, options.secondsPerFigure);
+        printAllocations(allocations);
+        printLogNote();
     }
     std::error_code ignored;
     if (ok) {

@@ -84,11 +84,13 @@ public:
     // - "errorcode" not 0: that code (its low 32 bits, signed) with "error",
     //   or "unknown error returned by Quamber subsystem" when there is none;
     // - no "errorcode" (or 0) and no "error": success.
-    // What the daemon should never send is an internal inconsistency, reported
-    // as code 4 rather than thrown, so bad input cannot crash a client:
-    // "errorcode" 0 or absent with an "error" ("qmd reported error without a
-    // code: <error>"), a reply that is not a dictionary, an "errorcode" that
-    // is not an integer.
+    // What the daemon should never send is an internal inconsistency. A
+    // departure from the design, which raises an exception for "errorcode" 0
+    // with an "error": here it is an error value, code 4, so that bad input
+    // can never crash a client and no exception crosses the library's
+    // boundary. The same holds for "errorcode" absent with an "error" ("qmd
+    // reported error without a code: <error>"), a reply that is not a
+    // dictionary, and an "errorcode" that is not an integer.
     static std::optional<qm::Error> errorInReply(const qm::Result<qm::Value>& reply);
 
     // Packs a property list into one message value when the version is

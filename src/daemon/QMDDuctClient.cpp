@@ -75,11 +75,12 @@ void QMDDuctClient::submitRequest(qm::duct::IncomingMessage&& message) {
     if (server_.verbose() >= 2) {
         server_.logger().debugInFull("incoming request %@", message.body());
     }
-    auto transaction = std::make_shared<Transaction>(std::move(message), shared_from_this());
-    bool mayRunInline = transaction->mayRunInline();
+    Transaction transaction(std::move(message), shared_from_this());
+    bool mayRunInline = transaction.mayRunInline();
+    // The job owns its transaction: run inline, it costs no allocation.
     server_.submitWork(
-        [transaction] {
-            QMDDuctClient& client = transaction->client();
+        [transaction = std::move(transaction)]() mutable {
+            QMDDuctClient& client = transaction.client();
             QMDServer& server = client.server();
             server.mainQueue().assertCurrent();
             if (server.stopping()) {
@@ -89,7 +90,7 @@ void QMDDuctClient::submitRequest(qm::duct::IncomingMessage&& message) {
             if (client.requestCount % 1000 == 0) {
                 server.debug("client %d used %u requests so far", client.pid(), client.requestCount);
             }
-            transaction->dispatch();
+            transaction.dispatch();
         },
         mayRunInline);
 }

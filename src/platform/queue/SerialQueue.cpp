@@ -60,12 +60,12 @@ void SerialQueue::workerLoop() {
         if (pending_.empty()) {
             return;  // stopping, nothing left
         }
-        std::function<void()> job = std::move(pending_.front());
+        QueuedJob job = std::move(pending_.front());
         pending_.pop_front();
         running_ = true;
         lock.unlock();
         runAsCurrent(job);
-        job = nullptr;  // destroy captures off the lock, still on this thread
+        { QueuedJob destroyed = std::move(job); }  // captures go off the lock, still on this thread
         lock.lock();
         running_ = false;
     }
@@ -73,7 +73,7 @@ void SerialQueue::workerLoop() {
 
 thread_local const SerialQueue::Running* SerialQueue::innermost_ = nullptr;
 
-void SerialQueue::runAsCurrent(const std::function<void()>& job) {
+void SerialQueue::runAsCurrent(QueuedJob& job) {
     ScopedRunning running(this);
     job();
 }
@@ -101,7 +101,7 @@ void SerialQueue::releaseClaim() {
     }
 }
 
-void SerialQueue::enqueue(std::function<void()> job) {
+void SerialQueue::enqueue(QueuedJob job) {
     assert(job);
     {
         std::lock_guard lock(mutex_);
@@ -113,7 +113,10 @@ void SerialQueue::enqueue(std::function<void()> job) {
 void SerialQueue::sync(const std::function<void()>& job) {
     assert(!heldByThisThread() && "sync() onto a queue this thread already runs: deadlock");
     if (tryClaimIdle()) {
-        runAsCurrent(job);
+        {
+            ScopedRunning running(this);
+            job();
+        }
         releaseClaim();
         return;
     }

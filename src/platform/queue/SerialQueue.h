@@ -21,9 +21,11 @@
 #include <condition_variable>
 #include <deque>
 #include <functional>
+#include <memory>
 #include <mutex>
 #include <string>
 #include <thread>
+#include <type_traits>
 
 namespace qm {
 
@@ -34,6 +36,32 @@ enum class QualityOfService : int {
     standard = 21,
     userInitiated = 25,
     userInteractive = 33,
+};
+
+// A job waiting on a queue: any callable, move-only ones included, so a job
+// can own what it works on (a request and its reply slot) without shared
+// ownership. One allocation per waiting job; none for a job run inline.
+class QueuedJob {
+public:
+    template <class Job>
+        requires(!std::is_same_v<std::decay_t<Job>, QueuedJob>)
+    QueuedJob(Job&& job) : job_(std::make_unique<Holder<std::decay_t<Job>>>(std::forward<Job>(job))) {}  // NOLINT
+    void operator()() { job_->run(); }
+    explicit operator bool() const noexcept { return job_ != nullptr; }
+
+private:
+    struct Base {
+        virtual ~Base() = default;
+        virtual void run() = 0;
+    };
+    template <class Job>
+    struct Holder final : Base {
+        explicit Holder(Job&& j) : job(std::move(j)) {}
+        explicit Holder(const Job& j) : job(j) {}
+        void run() override { job(); }
+        Job job;
+    };
+    std::unique_ptr<Base> job_;
 };
 
 class SerialQueue {
@@ -49,17 +77,17 @@ public:
     template <class Job>
     void async(Job&& job) {
         if (runsInlineWhenIdle_ && !runsOnAnyQueue() && tryClaimIdle()) {
-            // No std::function (and no allocation) on the inline path.
+            // No type erasure (and no allocation) on the inline path.
             runInline(job);
             return;
         }
-        enqueue(std::function<void()>(std::forward<Job>(job)));
+        enqueue(QueuedJob(std::forward<Job>(job)));
     }
     // The job runs once, on the worker thread, never on the caller's: for
     // jobs that may block, submitted from a thread that must not.
     template <class Job>
     void asyncOnWorker(Job&& job) {
-        enqueue(std::function<void()>(std::forward<Job>(job)));
+        enqueue(QueuedJob(std::forward<Job>(job)));
     }
     // Blocks until the job has run on this queue.
     void sync(const std::function<void()>& job);
@@ -79,8 +107,8 @@ public:
 
 private:
     void workerLoop();
-    void enqueue(std::function<void()> job);
-    void runAsCurrent(const std::function<void()>& job);
+    void enqueue(QueuedJob job);
+    void runAsCurrent(QueuedJob& job);
     // Pushes this queue on the calling thread's stack of running queues for
     // its scope; the entry lives in the frame that runs the job, so the stack
     // costs no allocation.
@@ -115,7 +143,7 @@ private:
     const bool runsInlineWhenIdle_;
     mutable std::mutex mutex_;
     std::condition_variable wake_;
-    std::deque<std::function<void()>> pending_;
+    std::deque<QueuedJob> pending_;
     bool running_ = false;  // a thread owns the queue and runs a job
     bool stopping_ = false;
     std::thread worker_;
