@@ -161,10 +161,12 @@ std::size_t DaemonProcess::openDescriptorCount() const {
 }
 
 ProgramResult runProgram(const std::vector<std::string>& argvIn, const std::map<std::string, std::string>& environment,
-                         std::chrono::milliseconds timeout) {
+                         std::chrono::milliseconds timeout, const std::string& standardInput) {
     TempDir scratch;
+    std::string inPath = scratch.file("in");
     std::string outPath = scratch.file("out");
     std::string errPath = scratch.file("err");
+    writeFile(inPath, standardInput);
     auto argv = argvIn;
     auto envStrings = mergedEnvironment(environment);
     auto argvPointers = pointers(argv);
@@ -173,7 +175,7 @@ ProgramResult runProgram(const std::vector<std::string>& argvIn, const std::map<
     if (pid == 0) {
         int out = ::open(outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
         int err = ::open(errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int in = ::open("/dev/null", O_RDONLY);
+        int in = ::open(inPath.c_str(), O_RDONLY);
         ::dup2(out, STDOUT_FILENO);
         ::dup2(err, STDERR_FILENO);
         ::dup2(in, STDIN_FILENO);

@@ -65,13 +65,15 @@ private:
     std::optional<int> status_;
 };
 
-// Runs a program to completion; exit status and captured output.
+// Runs a program to completion with the given standard input; exit status
+// and captured output.
 struct ProgramResult {
     int exitStatus = -1;  // -1 when killed by a signal
     std::string out;
     std::string err;
 };
 ProgramResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& environment = {},
-                         std::chrono::milliseconds timeout = std::chrono::seconds(30));
+                         std::chrono::milliseconds timeout = std::chrono::seconds(30),
+                         const std::string& standardInput = "");
 
 }  // namespace qmtest

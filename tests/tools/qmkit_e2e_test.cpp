@@ -1,11 +1,15 @@
 // qmkit end to end: its output and exit statuses against a real qmd.
 
 #include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 
 #include <gtest/gtest.h>
 
+#include <cstring>
 #include <thread>
 
+#include "platform/fd/UniqueFd.h"
 #include "platform/value/Json.h"
 #include "support/DaemonProcess.h"
 
@@ -19,9 +23,10 @@ using namespace std::chrono_literals;
 
 class Qmkit : public ::testing::Test {
 protected:
-    ProgramResult qmkit(std::vector<std::string> args) {
+    ProgramResult qmkit(std::vector<std::string> args, const std::string& input = "") {
         args.insert(args.begin(), {QMKIT_BINARY_PATH, "-S", daemon_.serviceName()});
-        return runProgram(args, {{"QM_DUCT_DIR", daemon_.runtimeDirectory()}, {"QM_LOG_STDERR", "0"}});
+        return runProgram(args, {{"QM_DUCT_DIR", daemon_.runtimeDirectory()}, {"QM_LOG_STDERR", "0"}},
+                          std::chrono::seconds(30), input);
     }
 
     DaemonProcess daemon_;
@@ -38,45 +43,54 @@ qm::Value parseJson(const std::string& text) {
     return value.ok() ? *value : qm::Value();
 }
 
-TEST(QmkitUsage, HelpForTheToolAndEachCommandExitsZero) {
-    ProgramResult tool = offline({"--help"});
-    EXPECT_EQ(tool.exitStatus, 0);
-    EXPECT_NE(tool.out.find("usage: qmkit"), std::string::npos);
-    EXPECT_NE(tool.out.find("bulk"), std::string::npos);
-    EXPECT_NE(tool.out.find("send"), std::string::npos);
-
-    ProgramResult bulk = offline({"bulk", "--help"});
-    EXPECT_EQ(bulk.exitStatus, 0);
-    EXPECT_NE(bulk.out.find("bulk [--flags N]"), std::string::npos);
-
-    ProgramResult send = offline({"send", "--help"});
-    EXPECT_EQ(send.exitStatus, 0);
-    EXPECT_NE(send.out.find("send JSON"), std::string::npos);
+bool startsWith(const std::string& text, const std::string& prefix) {
+    return prefix.empty() ? text.empty() : text.rfind(prefix, 0) == 0;
 }
 
-TEST(QmkitUsage, BadUsageExitsTwoWithAMessage) {
+// Runs without a daemon: help, version and every usage error.
+TEST(QmkitUsage, AnswersWithoutADaemon) {
     struct Case {
         std::vector<std::string> args;
-        const char* message;
+        int exitStatus;
+        std::string out;  // how standard output starts; empty: nothing
+        std::string err;  // how standard error starts; empty: nothing
     };
+    const std::string kTooLarge = "is too large (at most 18446744073709551615)\n";
     const Case cases[] = {
-        {{}, "qmkit: no command given"},
-        {{"frobnicate"}, "qmkit: unknown command \"frobnicate\""},
-        {{"--verbose", "bulk"}, "qmkit: unknown option \"--verbose\""},
-        {{"-S"}, "qmkit: -S needs a service name"},
-        {{"send"}, "qmkit: send: expected one JSON object"},
-        {{"send", "{\"request\": "}, "qmkit: send: invalid JSON: "},
-        {{"send", "[\"bulk\"]"}, "qmkit: send: the request must be a JSON object"},
-        {{"bulk", "--flags", "lots"}, "qmkit: bulk: flags must be a number, not \"lots\""},
-        {{"bulk", "--flags", "0x"}, "qmkit: bulk: flags must be a number"},
-        {{"bulk", "--flags"}, "qmkit: bulk: unexpected argument \"--flags\""},
-        {{"bulk", "extra"}, "qmkit: bulk: unexpected argument \"extra\""},
+        {{"--help"}, 0, "usage: qmkit [-S service] [--json] [--timeout SECONDS] <command>", ""},
+        {{"bulk", "--help"}, 0, "usage: qmkit [-S service] [--json] [--timeout SECONDS] bulk [--flags N]", ""},
+        {{"send", "--help"}, 0, "usage: qmkit [-S service] [--json] [--timeout SECONDS] send JSON", ""},
+        {{"--version"}, 0, "qmkit " QM_VERSION "\n", ""},
+        {{}, 2, "", "qmkit: no command given"},
+        {{"frobnicate"}, 2, "", "qmkit: unknown command \"frobnicate\""},
+        {{"--verbose", "bulk"}, 2, "", "qmkit: unknown option \"--verbose\""},
+        {{"-S"}, 2, "", "qmkit: -S needs a service name"},
+        {{"-S", "a/b", "bulk"}, 2, "", "qmkit: invalid service name \"a/b\""},
+        {{"-S", "", "bulk"}, 2, "", "qmkit: invalid service name \"\""},
+        {{"--timeout", "bulk"}, 2, "", "qmkit: --timeout must be a positive number of seconds, not \"bulk\""},
+        {{"--timeout", "0", "bulk"}, 2, "", "qmkit: --timeout must be a positive number of seconds, not \"0\""},
+        {{"--timeout", "-1", "bulk"}, 2, "", "qmkit: --timeout must be a positive number"},
+        {{"--timeout", "1000001", "bulk"}, 2, "", "qmkit: --timeout 1000001 is too large (at most 1000000)"},
+        {{"--timeout", "1" + std::string(400, '0'), "bulk"}, 2, "", "qmkit: --timeout 1000"},
+        {{"send"}, 2, "", "qmkit: send: expected one JSON object"},
+        {{"send", "{\"request\": "}, 2, "", "qmkit: send: invalid JSON: "},
+        {{"send", "[\"bulk\"]"}, 2, "", "qmkit: send: the request must be a JSON object"},
+        {{"send", "{\"flags\": 18446744073709551616}"}, 2, "",
+         "qmkit: send: invalid JSON: integer does not fit in 64 bits at line 1, column 11\n"},
+        {{"send", "-"}, 2, "", "qmkit: send: invalid JSON: syntax error while parsing value - unexpected end of input"},
+        {{"bulk", "--flags", "lots"}, 2, "", "qmkit: bulk: --flags must be a number (decimal or 0x-hex), not \"lots\""},
+        {{"bulk", "--flags", "0x"}, 2, "", "qmkit: bulk: --flags must be a number"},
+        {{"bulk", "--flags", "18446744073709551616"}, 2, "", "qmkit: bulk: --flags 18446744073709551616 " + kTooLarge},
+        {{"bulk", "--flags", "0x10000000000000000"}, 2, "", "qmkit: bulk: --flags 0x10000000000000000 " + kTooLarge},
+        {{"bulk", "--flags"}, 2, "", "qmkit: bulk: unexpected argument \"--flags\""},
+        {{"bulk", "extra"}, 2, "", "qmkit: bulk: unexpected argument \"extra\""},
     };
     for (const Case& c : cases) {
         ProgramResult result = offline(c.args);
-        EXPECT_EQ(result.exitStatus, 2) << c.message;
-        EXPECT_EQ(result.err.rfind(c.message, 0), 0u) << result.err;
-        EXPECT_TRUE(result.out.empty()) << result.out;
+        const std::string what = c.args.empty() ? "(no arguments)" : c.args.front() + " ...";
+        EXPECT_EQ(result.exitStatus, c.exitStatus) << what << ": " << result.err;
+        EXPECT_TRUE(startsWith(result.out, c.out)) << what << ": " << result.out;
+        EXPECT_TRUE(startsWith(result.err, c.err)) << what << ": " << result.err;
     }
 }
 
@@ -87,6 +101,27 @@ TEST(QmkitUsage, AnUnreachableDaemonExitsThree) {
     EXPECT_EQ(result.exitStatus, 3);
     EXPECT_EQ(result.err, "qmkit: cannot reach qmd (service \"nobody.qmd\"): cannot connect to " +
                               scratch.file("nobody.qmd") + ": No such file or directory\n");
+}
+
+// A service that takes connections and never answers: qmkit gives up after
+// its timeout rather than waiting for ever.
+TEST(QmkitUsage, ADaemonThatNeverAnswersTimesOut) {
+    qmtest::TempDir scratch;
+    const std::string path = scratch.file("mute.qmd");
+    qm::UniqueFd listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    ASSERT_TRUE(listener);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    ASSERT_LT(path.size(), sizeof address.sun_path);
+    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+    ASSERT_EQ(::bind(listener.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    ASSERT_EQ(::listen(listener.get(), 4), 0);
+
+    ProgramResult result = runProgram({QMKIT_BINARY_PATH, "-S", "mute.qmd", "--timeout", "0.2", "bulk"},
+                                      {{"QM_DUCT_DIR", scratch.path()}, {"QM_LOG_STDERR", "0"}});
+    EXPECT_EQ(result.exitStatus, 3);
+    EXPECT_EQ(result.err, "qmkit: no reply within 0.2 s\n");
+    EXPECT_EQ(result.out, "");
 }
 
 TEST_F(Qmkit, BulkSucceedsQuietlyAndPassesItsFlags) {
@@ -103,7 +138,7 @@ TEST_F(Qmkit, BulkSucceedsQuietlyAndPassesItsFlags) {
 }
 
 TEST_F(Qmkit, SendAddsTheCurrentVersionOnlyWhenItIsMissing) {
-    ProgramResult added = qmkit({"send", "{\"request\": \"bulk\", \"flags\": 7}"});
+    ProgramResult added = qmkit({"send", "-"}, "{\"request\": \"bulk\",\n \"flags\": 7}\n");
     EXPECT_EQ(added.exitStatus, 0) << added.err;
     EXPECT_EQ(added.out, "{}\n");
     EXPECT_TRUE(daemon_.waitForLog("bulk options 0x7 not supported"));

@@ -4,6 +4,7 @@
 //
 // Exit statuses shared by every subcommand.
 
+#include <chrono>
 #include <string>
 #include <vector>
 
@@ -17,6 +18,10 @@ enum QmkitExit : int {
 struct QmkitGlobalOptions {
     std::string serviceName = "ovaro.quamber.qmd";  // -S
     bool json = false;                              // --json
+    // --timeout: bounds connecting, sending and waiting for the reply; the
+    // text as given, for messages.
+    std::chrono::milliseconds timeout{30000};
+    std::string timeoutText = "30";
 };
 
 struct QmkitCommand {

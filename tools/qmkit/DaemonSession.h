@@ -5,11 +5,11 @@
 // Outcomes: a reply without error prints with the command's own printer (or
 // as JSON with --json) and exits 0; an error reply writes "qmkit: <message>
 // (code N)" on standard error and exits 1 (with --json the reply is printed
-// too, for scripts that want its other keys); a daemon that cannot be
-// reached, a connection that dies before the reply, or no reply within the
-// timeout writes "qmkit: <reason>" and exits 3.
+// too, for scripts that want its other keys); a daemon that cannot be reached
+// or a connection that dies before the reply writes "qmkit: <reason>" and
+// exits 3, and so does a reply that does not come within the timeout
+// ("qmkit: no reply within N s", N as given to --timeout).
 
-#include <chrono>
 #include <functional>
 
 #include "Command.h"
@@ -18,9 +18,6 @@
 
 class DaemonSession {
 public:
-    // Bounds connecting, writing and waiting for the reply.
-    static constexpr std::chrono::milliseconds kTimeout{30000};
-
     using Start = std::function<void(QMDaemonClient& client, QMDaemonClient::ReplyHandler handler)>;
     using Printer = std::function<void(const qm::Value& reply)>;
 
@@ -28,6 +25,7 @@ public:
 
     // Issues the request that `start` sends and reports its reply; returns
     // the exit status. `printSuccess` prints a successful reply for people.
+    // Connecting, sending and waiting are each bounded by options.timeout.
     int run(const Start& start, const Printer& printSuccess) const;
 
 private:

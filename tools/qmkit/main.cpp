@@ -3,20 +3,25 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstring>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include "Command.h"
+#include "NumberOptions.h"
 
 namespace {
 
 void usage(std::FILE* to) {
     std::fputs(
-        "usage: qmkit [-S service] [--json] <command> [arguments]\n"
-        "       qmkit --help | qmkit <command> --help\n"
+        "usage: qmkit [-S service] [--json] [--timeout SECONDS] <command> [arguments]\n"
+        "       qmkit --help | qmkit <command> --help | qmkit --version\n"
         "\n"
-        "  -S service   the daemon's service name (default \"ovaro.quamber.qmd\")\n"
-        "  --json       print results as JSON\n"
+        "  -S service          the daemon's service name (default \"ovaro.quamber.qmd\");\n"
+        "                      not empty, no \"/\"\n"
+        "  --json              print results as JSON\n"
+        "  --timeout SECONDS   give up when the daemon has not answered within SECONDS\n"
+        "                      (default 30, at most 1000000; may be fractional)\n"
         "\n"
         "commands:\n",
         to);
@@ -29,7 +34,7 @@ void usage(std::FILE* to) {
     std::fputs(
         "\n"
         "exit status: 0 success, 1 the daemon answered an error, 2 bad usage,\n"
-        "3 the daemon cannot be reached\n",
+        "3 the daemon cannot be reached or did not answer in time\n",
         to);
 }
 
@@ -52,29 +57,59 @@ bool asksForHelp(const std::vector<std::string>& args) {
     return std::any_of(args.begin(), args.end(), [](const std::string& a) { return a == "--help" || a == "-h"; });
 }
 
+// Reads the options before the command from argv[next] on, leaving next at
+// the command. An exit status when qmkit is done (help, version, bad usage).
+std::optional<int> readGlobalOptions(int argc, char** argv, int& next, QmkitGlobalOptions& options) {
+    for (; next < argc && argv[next][0] == '-'; ++next) {
+        const std::string option = argv[next];
+        if (option == "--help" || option == "-h") {
+            usage(stdout);
+            return kQmkitOk;
+        }
+        if (option == "--version") {
+            std::printf("qmkit %s\n", QM_VERSION);
+            return kQmkitOk;
+        }
+        if (option == "--json") {
+            options.json = true;
+            continue;
+        }
+        if (option.rfind("-S", 0) == 0 && option != "-S") {
+            options.serviceName = option.substr(2);
+            continue;
+        }
+        if (option != "-S" && option != "--timeout") {
+            return usageError("unknown option \"" + option + "\"");
+        }
+        if (next + 1 == argc) {
+            return usageError(option + (option == "-S" ? " needs a service name" : " needs a number of seconds"));
+        }
+        const std::string value = argv[++next];
+        if (option == "-S") {
+            options.serviceName = value;
+            continue;
+        }
+        auto timeout = parseSecondsOption(option, value);
+        if (!timeout) {
+            return usageError(timeout.error());
+        }
+        options.timeout = *timeout;
+        options.timeoutText = value;
+    }
+    // The name of a socket in the runtime directory.
+    if (options.serviceName.empty() || options.serviceName.find('/') != std::string::npos) {
+        return usageError("invalid service name \"" + options.serviceName + "\": it must not be empty or hold \"/\"");
+    }
+    return std::nullopt;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
     QmkitGlobalOptions options;
     int i = 1;
-    for (; i < argc && argv[i][0] == '-'; ++i) {
-        std::string option = argv[i];
-        if (option == "--help" || option == "-h") {
-            usage(stdout);
-            return kQmkitOk;
-        }
-        if (option == "--json") {
-            options.json = true;
-        } else if (option == "-S") {
-            if (i + 1 == argc) {
-                return usageError("-S needs a service name");
-            }
-            options.serviceName = argv[++i];
-        } else if (option.rfind("-S", 0) == 0) {
-            options.serviceName = option.substr(2);
-        } else {
-            return usageError("unknown option \"" + option + "\"");
-        }
+    if (auto done = readGlobalOptions(argc, argv, i, options)) {
+        return *done;
     }
     if (i == argc) {
         return usageError("no command given");

@@ -3,81 +3,54 @@
 #include <openssl/evp.h>
 
 #include <algorithm>
-#include <array>
-#include <cstdint>
 
 namespace qm::base64 {
 
 namespace {
 
-constexpr std::uint8_t kNotInAlphabet = 0xFF;
-
-constexpr std::array<std::uint8_t, 256> makeDecodingTable() {
-    std::array<std::uint8_t, 256> table{};
-    table.fill(kNotInAlphabet);
-    constexpr std::string_view alphabet = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-    for (std::size_t i = 0; i < alphabet.size(); ++i) {
-        table[static_cast<unsigned char>(alphabet[i])] = static_cast<std::uint8_t>(i);
-    }
-    return table;
-}
-
-constexpr auto kDecodingTable = makeDecodingTable();
+// OpenSSL takes int lengths: work in chunks of whole groups, so that no chunk
+// boundary adds padding.
+constexpr std::size_t kBytesPerChunk = 3 * (1u << 24);
+constexpr std::size_t kCharactersPerChunk = kBytesPerChunk / 3 * 4;
+constexpr std::string_view kAlphabet = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
 
 }  // namespace
 
 std::string encode(const Bytes& data) {
-    // EVP_EncodeBlock takes an int length: feed it whole groups of three bytes
-    // at a time so no chunk boundary adds padding.
-    constexpr std::size_t kChunk = 3 * (1u << 24);
     std::string out;
-    out.reserve((data.size() + 2) / 3 * 4 + 1);
-    std::size_t offset = 0;
-    do {
-        std::size_t chunk = std::min(kChunk, data.size() - offset);
+    for (std::size_t offset = 0; offset < data.size(); offset += kBytesPerChunk) {
+        std::size_t chunk = std::min(kBytesPerChunk, data.size() - offset);
         std::size_t start = out.size();
         out.resize(start + (chunk + 2) / 3 * 4 + 1);  // EVP_EncodeBlock writes a NUL
         int written = EVP_EncodeBlock(reinterpret_cast<unsigned char*>(out.data() + start), data.data() + offset,
                                       static_cast<int>(chunk));
         out.resize(start + static_cast<std::size_t>(written));
-        offset += chunk;
-    } while (offset < data.size());
+    }
     return out;
 }
 
 std::optional<Bytes> decode(std::string_view text) {
-    if (text.size() % 4 != 0) {
+    // EVP_DecodeBlock skips white space at the ends and reads "=" anywhere as
+    // zero bits: only canonical text reaches it.
+    std::size_t padding = text.size() - (text.find_last_not_of('=') + 1);  // npos + 1 is 0
+    if (text.size() % 4 != 0 || padding > 2 ||
+        text.substr(0, text.size() - padding).find_first_not_of(kAlphabet) != std::string_view::npos) {
         return std::nullopt;
     }
-    std::size_t padding = 0;
-    if (!text.empty() && text.back() == '=') {
-        padding = text[text.size() - 2] == '=' ? 2 : 1;
-    }
-    Bytes out;
-    out.reserve(text.size() / 4 * 3);
-    for (std::size_t group = 0; group < text.size(); group += 4) {
-        bool last = group + 4 == text.size();
-        std::size_t symbols = last ? 4 - padding : 4;
-        std::uint32_t bits = 0;
-        for (std::size_t i = 0; i < 4; ++i) {
-            std::uint8_t sextet = 0;
-            if (i < symbols) {
-                sextet = kDecodingTable[static_cast<unsigned char>(text[group + i])];
-                if (sextet == kNotInAlphabet) {
-                    return std::nullopt;
-                }
-            }
-            bits = (bits << 6) | sextet;
-        }
-        std::size_t bytes = symbols - 1;
-        // Bits that no byte takes must be zero, so each data has one spelling.
-        if (bytes < 3 && (bits & ((1u << (8 * (3 - bytes))) - 1)) != 0) {
+    Bytes out(text.size() / 4 * 3);
+    for (std::size_t offset = 0; offset < text.size(); offset += kCharactersPerChunk) {
+        std::size_t chunk = std::min(kCharactersPerChunk, text.size() - offset);
+        if (EVP_DecodeBlock(out.data() + offset / 4 * 3, reinterpret_cast<const unsigned char*>(text.data() + offset),
+                            static_cast<int>(chunk)) < 0) {
             return std::nullopt;
         }
-        for (std::size_t i = 0; i < bytes; ++i) {
-            out.push_back(static_cast<std::uint8_t>(bits >> (16 - 8 * i)));
-        }
     }
+    // Padding decodes to whole zero bytes; bits of the last character that no
+    // byte takes land there too and must be zero, so each data has one spelling.
+    if (std::any_of(out.end() - static_cast<std::ptrdiff_t>(padding), out.end(), [](std::uint8_t b) { return b != 0; })) {
+        return std::nullopt;
+    }
+    out.resize(out.size() - padding);
     return out;
 }
 
