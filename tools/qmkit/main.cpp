@@ -9,6 +9,7 @@
 
 #include "Command.h"
 #include "NumberOptions.h"
+#include "platform/duct/ServiceSocket.h"
 
 namespace {
 
@@ -96,8 +97,7 @@ std::optional<int> readGlobalOptions(int argc, char** argv, int& next, QmkitGlob
         options.timeout = *timeout;
         options.timeoutText = value;
     }
-    // The name of a socket in the runtime directory.
-    if (options.serviceName.empty() || options.serviceName.find('/') != std::string::npos) {
+    if (!qm::duct::isValidServiceName(options.serviceName)) {
         return usageError("invalid service name \"" + options.serviceName + "\": it must not be empty or hold \"/\"");
     }
     return std::nullopt;

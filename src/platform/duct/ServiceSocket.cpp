@@ -60,8 +60,12 @@ MaybeError checkRuntimeDirectory(const std::string& directory, const struct stat
 
 }  // namespace
 
+bool isValidServiceName(const std::string& serviceName) {
+    return !serviceName.empty() && serviceName.find('/') == std::string::npos;
+}
+
 Result<std::string> serviceSocketPath(const std::string& serviceName) {
-    if (serviceName.empty() || serviceName.find('/') != std::string::npos) {
+    if (!isValidServiceName(serviceName)) {
         return ductError(EINVAL, "invalid service name \"" + serviceName + "\"");
     }
     return ductRuntimeDirectory() + "/" + serviceName;

@@ -19,6 +19,10 @@ namespace qm::duct {
 
 inline constexpr const char* kDuctErrorDomain = "duct";
 
+// A service name names a socket inside the runtime directory: it is not
+// empty and holds no "/".
+bool isValidServiceName(const std::string& serviceName);
+
 // The path of a service's socket, after checking the name (no I/O).
 Result<std::string> serviceSocketPath(const std::string& serviceName);
 
