@@ -9,7 +9,7 @@
 #include "daemon/QMDServer.h"
 #include "platform/log/SystemLog.h"
 #include "support/LogCapture.h"
-#include "support/RawClient.h"
+#include "support/FramePeer.h"
 #include "support/ScopedEnvironment.h"
 #include "support/TempDir.h"
 
@@ -43,10 +43,10 @@ TEST(DeadClient, QueuedRequestsOfADeadClientGetNoHandlerAndNoReply) {
     }
     std::string socketPath = dir.file("duct") + "/dead.qmd";
     {
-        qmtest::RawClient client(socketPath);
+        qmtest::FramePeer client(socketPath);
         ASSERT_TRUE(client.connected());
         for (int i = 0; i < 3; ++i) {
-            client.send(qmtest::request({{"request", "bulk"}, {"version", std::uint64_t{3}}}));
+            client.send(qmtest::bulk());
         }
     }  // hangs up with three requests queued
     EXPECT_TRUE(log.waitFor("client " + std::to_string(::getpid()) + " is dead"));
@@ -62,8 +62,8 @@ TEST(DeadClient, QueuedRequestsOfADeadClientGetNoHandlerAndNoReply) {
     EXPECT_EQ(log.text().find("request bulk"), std::string::npos) << log.text();
 
     // A live client is still served afterwards.
-    qmtest::RawClient live(socketPath);
-    auto reply = live.roundTrip(qmtest::request({{"request", "bulk"}, {"version", std::uint64_t{3}}}));
+    qmtest::FramePeer live(socketPath);
+    auto reply = live.roundTrip(qmtest::bulk());
     EXPECT_TRUE(reply);
     EXPECT_TRUE(log.waitFor("bulk options 0x0 not supported"));
 
