@@ -92,9 +92,6 @@ DaemonProcess::DaemonProcess(DaemonOptions options) : serviceName_(options.servi
         ::_exit(127);
     }
     ::close(logFd);
-    if (!options.waitForSocket) {
-        return;
-    }
     auto deadline = Clock::now() + std::chrono::seconds(10);
     while (Clock::now() < deadline) {
         if (FramePeer::canConnect(socketPath())) {

@@ -35,14 +35,7 @@ public:
         }
         return all;
     }
-    std::size_t countContaining(const std::string& needle) const {
-        std::size_t count = 0;
-        for (const auto& line : lines()) {
-            count += line.find(needle) != std::string::npos ? 1 : 0;
-        }
-        return count;
-    }
-    bool contains(const std::string& needle) const { return countContaining(needle) > 0; }
+    bool contains(const std::string& needle) const { return text().find(needle) != std::string::npos; }
     // Waits up to five seconds for a line holding the text.
     bool waitFor(const std::string& needle) const {
         for (int i = 0; i < 500; ++i) {
