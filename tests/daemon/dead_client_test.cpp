@@ -8,8 +8,8 @@
 
 #include "daemon/QMDServer.h"
 #include "platform/log/SystemLog.h"
-#include "support/LogCapture.h"
 #include "support/FramePeer.h"
+#include "support/LogCapture.h"
 #include "support/ScopedEnvironment.h"
 #include "support/TempDir.h"
 

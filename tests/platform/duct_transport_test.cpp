@@ -8,9 +8,8 @@
 #include <mutex>
 #include <thread>
 
-#include "platform/duct/Listener.h"
-#include "platform/duct/ServiceSocket.h"
 #include "platform/duct/Frame.h"
+#include "platform/duct/Listener.h"
 #include "support/FramePeer.h"
 #include "support/ScopedEnvironment.h"
 #include "support/TempDir.h"
