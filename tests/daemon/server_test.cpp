@@ -12,7 +12,7 @@
 
 #include "daemon/QMDServer.h"
 #include "support/LogCapture.h"
-#include "support/RawClient.h"
+#include "support/FramePeer.h"
 #include "support/ScopedEnvironment.h"
 #include "support/TempDir.h"
 
@@ -63,8 +63,6 @@ protected:
             loop.join();
         }
     }
-    static qm::Value bulk() { return qmtest::request({{"request", "bulk"}, {"version", std::uint64_t{3}}}); }
-
     qmtest::TempDir dir;
     qmtest::ScopedEnvironment ductDirectory{"QM_DUCT_DIR", dir.file("duct")};
     qmtest::LogCapture log;
@@ -75,9 +73,9 @@ protected:
 
 TEST_F(InProcessServer, NothingIsAnsweredBeforeTheRegistryIsReady) {
     start(/*registryReady=*/false);
-    qmtest::RawClient early(socketPath);
+    qmtest::FramePeer early(socketPath);
     ASSERT_TRUE(early.connected()) << "connecting waits in the backlog";
-    auto id = early.send(bulk());
+    auto id = early.send(qmtest::bulk());
     EXPECT_FALSE(early.receive(std::chrono::milliseconds(300))) << "answered before the first scan";
     server->registry().markReady();
     auto reply = early.receive();
@@ -91,11 +89,11 @@ TEST_F(InProcessServer, ALongHandlerNeitherDelaysAcceptsNorHangUpsNorServesTheDe
     std::string pid = std::to_string(::getpid());
     MainQueueBlocker longHandler(*server);
     {
-        qmtest::RawClient client(socketPath);
+        qmtest::FramePeer client(socketPath);
         ASSERT_TRUE(client.connected());
         EXPECT_TRUE(log.waitFor("client " + pid + " ")) << "accepted while mainQueue is busy";
         for (int i = 0; i < 3; ++i) {
-            client.send(bulk());
+            client.send(qmtest::bulk());
         }
     }  // hangs up with three requests queued
     EXPECT_TRUE(log.waitFor("client " + pid + " is dead")) << "hang-up seen while mainQueue is busy";
@@ -103,8 +101,8 @@ TEST_F(InProcessServer, ALongHandlerNeitherDelaysAcceptsNorHangUpsNorServesTheDe
     server->mainQueue().sync([] {});
     EXPECT_FALSE(log.contains("bulk options")) << "a dead client's queued requests ran:\n" << log.text();
 
-    qmtest::RawClient live(socketPath);
-    EXPECT_TRUE(live.roundTrip(bulk()));
+    qmtest::FramePeer live(socketPath);
+    EXPECT_TRUE(live.roundTrip(qmtest::bulk()));
 }
 
 }  // namespace

@@ -1,33 +1,27 @@
 // Starting qmd: its command line, its claim on the service name, socket
 // activation and the idle exit.
 
-#include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include <csignal>
-#include <cstring>
 #include <thread>
 
 #include "support/DaemonProcess.h"
-#include "support/RawClient.h"
+#include "support/FramePeer.h"
 
 using qmtest::DaemonOptions;
 using qmtest::DaemonProcess;
-using qmtest::RawClient;
+using qmtest::FramePeer;
+using qmtest::bulk;
 using qmtest::runProgram;
 
 namespace {
 
 const char kUsage[] = "Usage: qmd [-S servicename] [-v]\n";
-
-qm::Value bulk() {
-    return qmtest::request({{"request", "bulk"}, {"version", std::uint64_t{3}}});
-}
 
 TEST(Startup, BadCommandLinesPrintTheUsageAndExitTwo) {
     qmtest::TempDir dir;
@@ -42,7 +36,6 @@ TEST(Startup, BadCommandLinesPrintTheUsageAndExitTwo) {
     }
     auto unknown = runProgram({QMD_BINARY_PATH, "-x"}, env);
     EXPECT_NE(unknown.err.find("invalid option"), std::string::npos) << unknown.err;
-    EXPECT_EQ(std::string(kUsage).size(), 33u);
 }
 
 TEST(Startup, InformationalOptionsPrintAndExitZero) {
@@ -116,7 +109,7 @@ TEST(Startup, ASecondDaemonOnTheSameNameLeavesTheFirstAlone) {
                              {{"QM_DUCT_DIR", first.runtimeDirectory()}, {"QM_LOG_STDERR", "1"}});
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_NE(result.err.find("service already running on " + first.socketPath()), std::string::npos) << result.err;
-    RawClient client(first.socketPath());
+    FramePeer client(first.socketPath());
     EXPECT_TRUE(client.roundTrip(bulk()));
 }
 
@@ -125,33 +118,22 @@ TEST(Startup, AStaleSocketFileIsReplaced) {
     std::string duct = dir.file("duct");
     ASSERT_EQ(::mkdir(duct.c_str(), 0700), 0);
     std::string path = duct + "/stale.qmd";
-    {
-        qm::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM, 0));
-        sockaddr_un address{};
-        address.sun_family = AF_UNIX;
-        std::strcpy(address.sun_path, path.c_str());
-        ASSERT_EQ(::bind(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-    }  // closed without listening: nobody answers there
+    FramePeer::listenAt(path);  // closed at once: nobody answers there
     DaemonOptions options = qmtest::withEnvironment({{"QM_DUCT_DIR", duct}});
     options.serviceName = "stale.qmd";
     DaemonProcess daemon(options);
-    RawClient client(path);
+    FramePeer client(path);
     EXPECT_TRUE(client.roundTrip(bulk()));
 }
 
 TEST(Startup, ASocketPassedByTheServiceManagerIsUsed) {
     qmtest::TempDir dir;
     std::string path = dir.file("activated.sock");
-    qm::UniqueFd listener(::socket(AF_UNIX, SOCK_STREAM, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strcpy(address.sun_path, path.c_str());
-    ASSERT_EQ(::bind(listener.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-    ASSERT_EQ(::listen(listener.get(), 16), 0);
+    qm::UniqueFd listener = FramePeer::listenAt(path);
     std::string duct = dir.file("duct");
     pid_t pid = ::fork();
     if (pid == 0) {
-        ::dup2(listener.get(), 3);
+        ::dup2(::dup(listener.get()), 3);  // the copy drops close-on-exec, even were the listener fd 3
         std::string pidText = std::to_string(::getpid());
         ::setenv("LISTEN_FDS", "1", 1);
         ::setenv("LISTEN_PID", pidText.c_str(), 1);
@@ -160,11 +142,11 @@ TEST(Startup, ASocketPassedByTheServiceManagerIsUsed) {
         ::_exit(127);
     }
     listener.reset();
-    RawClient client(path);
+    FramePeer client(path);
     auto reply = client.roundTrip(bulk());
     EXPECT_TRUE(reply);
     // It did not claim a socket of its own.
-    EXPECT_FALSE(RawClient::tryConnect(duct + "/activated.qmd"));
+    EXPECT_FALSE(FramePeer::canConnect(duct + "/activated.qmd"));
     ::kill(pid, SIGKILL);
     ::waitpid(pid, nullptr, 0);
 }
@@ -184,7 +166,7 @@ TEST(Startup, TerminationSignalsEndTheDaemonInOrder) {
     for (auto [signal, name] : {std::pair{SIGTERM, "SIGTERM"}, std::pair{SIGINT, "SIGINT"}}) {
         DaemonProcess daemon(qmtest::withArguments({"-v"}));
         EXPECT_TRUE(daemon.waitForLog("listening on " + daemon.socketPath()));
-        RawClient client(daemon.socketPath());
+        FramePeer client(daemon.socketPath());
         ASSERT_TRUE(client.roundTrip(bulk()));
         ::kill(daemon.pid(), signal);
         expectOrderlyExit(daemon, std::string("exiting on ") + name);
@@ -194,7 +176,7 @@ TEST(Startup, TerminationSignalsEndTheDaemonInOrder) {
 TEST(Startup, AnIdleDaemonExitsButNotUnderAConnectedClient) {
     DaemonProcess daemon(qmtest::withEnvironment({{"QM_IDLE_EXIT", "1"}}));
     {
-        RawClient client(daemon.socketPath());
+        FramePeer client(daemon.socketPath());
         ASSERT_TRUE(client.roundTrip(bulk()));
         std::this_thread::sleep_for(std::chrono::milliseconds(2500));
         EXPECT_TRUE(daemon.running());

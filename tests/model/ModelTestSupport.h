@@ -2,15 +2,9 @@
 // Helpers shared by the model's tests: captured log lines, environment
 // variables set for one test and restored after it, and short value literals.
 
-#include <cstdlib>
 #include <initializer_list>
-#include <mutex>
-#include <optional>
 #include <ostream>
-#include <string>
-#include <vector>
 
-#include "platform/log/SystemLog.h"
 #include "platform/value/Value.h"
 #include "support/LogCapture.h"
 #include "support/ScopedEnvironment.h"

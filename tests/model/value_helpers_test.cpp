@@ -2,92 +2,76 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <string>
+#include <tuple>
 #include <vector>
 
 namespace {
 
-TEST(DictionaryChanging, SetsAKeyInACopy) {
-    qm::Value original(qm::Dictionary{{"a", qm::Value(1)}});
-    auto changed = dictionaryChanging(original, "b", qm::Value("two"));
-    ASSERT_TRUE(changed);
-    EXPECT_EQ(*changed, qm::Value(qm::Dictionary{{"a", qm::Value(1)}, {"b", qm::Value("two")}}));
-    EXPECT_EQ(original, qm::Value(qm::Dictionary{{"a", qm::Value(1)}}));
+using qm::Array;
+using qm::Dictionary;
+using qm::Value;
+
+TEST(DictionaryChanging, ChangesACopySharingTheEntriesItLeaves) {
+    Value list(Array{1, 2});
+    Value original(Dictionary{{"a", 1}, {"list", list}});
+    struct Case {
+        const char* key;
+        std::optional<Value> value;
+        Value expected;
+    };
+    const Case cases[] = {
+        {"b", Value("two"), Value(Dictionary{{"a", 1}, {"b", "two"}, {"list", list}})},
+        {"a", Value(2), Value(Dictionary{{"a", 2}, {"list", list}})},
+        {"a", std::nullopt, Value(Dictionary{{"list", list}})},
+        {"zzz", std::nullopt, original},  // removing what is not there is a plain copy
+    };
+    for (const Case& c : cases) {
+        auto changed = dictionaryChanging(original, c.key, c.value);
+        ASSERT_TRUE(changed) << c.key;
+        EXPECT_EQ(*changed, c.expected) << c.key;
+        EXPECT_TRUE(changed->get("list")->isSameObject(list)) << c.key;
+    }
+    EXPECT_EQ(original, Value(Dictionary{{"a", 1}, {"list", list}})) << "the receiver keeps its entries";
+    EXPECT_FALSE(dictionaryChanging(std::nullopt, "a", Value(1)));
+    EXPECT_FALSE(dictionaryChanging(Value(Array{}), "a", Value(1)));
+    EXPECT_FALSE(dictionaryChanging(Value("text"), "a", std::nullopt));
 }
 
-TEST(DictionaryChanging, ReplacesAnExistingKey) {
-    qm::Value original(qm::Dictionary{{"a", qm::Value(1)}});
-    auto changed = dictionaryChanging(original, "a", qm::Value(2));
-    ASSERT_TRUE(changed);
-    EXPECT_EQ(changed->get("a")->asSigned(), 2);
-    EXPECT_EQ(original.get("a")->asSigned(), 1);
-}
-
-TEST(DictionaryChanging, NothingRemovesTheKeyButTheReceiverKeepsIt) {
-    qm::Value original(qm::Dictionary{{"a", qm::Value(1)}, {"b", qm::Value(2)}});
-    auto changed = dictionaryChanging(original, "a", std::nullopt);
-    ASSERT_TRUE(changed);
-    EXPECT_FALSE(changed->get("a"));
-    EXPECT_TRUE(changed->get("b"));
-    EXPECT_TRUE(original.get("a"));
-    // Removing a key that is not there is a plain copy.
-    EXPECT_EQ(dictionaryChanging(original, "zzz", std::nullopt), original);
-}
-
-TEST(DictionaryChanging, EntriesAreSharedNotCopied) {
-    qm::Value list(qm::Array{qm::Value(1), qm::Value(2)});
-    qm::Value original(qm::Dictionary{{"list", list}});
-    auto changed = dictionaryChanging(original, "other", qm::Value(true));
-    ASSERT_TRUE(changed);
-    EXPECT_TRUE(changed->get("list")->isSameObject(list));
-}
-
-TEST(DictionaryChanging, NothingForNothingOrANonDictionary) {
-    EXPECT_FALSE(dictionaryChanging(std::nullopt, "a", qm::Value(1)));
-    EXPECT_FALSE(dictionaryChanging(qm::Value(qm::Array{}), "a", qm::Value(1)));
-    EXPECT_FALSE(dictionaryChanging(qm::Value("text"), "a", std::nullopt));
-}
-
-TEST(CompareVersionString, DigitRunsCompareByValue) {
-    EXPECT_EQ(compareVersionString("2.10", "2.9"), std::strong_ordering::greater);
-    EXPECT_EQ(compareVersionString("2.9", "2.10"), std::strong_ordering::less);
-    EXPECT_EQ(compareVersionString("10", "9"), std::strong_ordering::greater);
-    EXPECT_EQ(compareVersionString("1.0", "1.0"), std::strong_ordering::equal);
-    EXPECT_EQ(compareVersionString("1.2.3", "1.2.10"), std::strong_ordering::less);
-    EXPECT_EQ(compareVersionString("", ""), std::strong_ordering::equal);
-}
-
-TEST(CompareVersionString, RunsLongerThanAnyIntegerType) {
-    EXPECT_EQ(compareVersionString("1.123456789012345678901234567890", "1.123456789012345678901234567889"),
-              std::strong_ordering::greater);
-    EXPECT_EQ(compareVersionString("99999999999999999999999", "100000000000000000000000"),
-              std::strong_ordering::less);
-    EXPECT_EQ(compareVersionString("18446744073709551616", "18446744073709551616"), std::strong_ordering::equal);
-}
-
-TEST(CompareVersionString, LeadingZerosOnlyBreakTies) {
-    // Numerically the same: fewer leading zeros first, so equal still means identical.
-    EXPECT_EQ(compareVersionString("1.1", "1.01"), std::strong_ordering::less);
-    EXPECT_EQ(compareVersionString("1.01", "1.001"), std::strong_ordering::less);
-    EXPECT_EQ(compareVersionString("0", "00"), std::strong_ordering::less);
-    // Never against the numeric order.
-    EXPECT_EQ(compareVersionString("1.01", "1.2"), std::strong_ordering::less);
-    EXPECT_EQ(compareVersionString("1.01.9", "1.1.8"), std::strong_ordering::greater);
-    EXPECT_EQ(compareVersionString("01.1", "1.2"), std::strong_ordering::less);
-    // The first run that differs in zeros decides.
-    EXPECT_EQ(compareVersionString("1.01.1", "1.1.001"), std::strong_ordering::greater);
-}
-
-TEST(CompareVersionString, OtherCharactersCompareLiterally) {
-    EXPECT_EQ(compareVersionString("1.0a", "1.0b"), std::strong_ordering::less);
-    EXPECT_EQ(compareVersionString("1.0B", "1.0a"), std::strong_ordering::less);  // by byte, not by case
-    EXPECT_EQ(compareVersionString("1.0", "1.0.1"), std::strong_ordering::less);  // a prefix first
-    EXPECT_EQ(compareVersionString("1.0", "1.0a"), std::strong_ordering::less);
-    EXPECT_EQ(compareVersionString("1-beta", "1.beta"), std::strong_ordering::less);  // '-' < '.'
-    EXPECT_EQ(compareVersionString("1.x", "1.5"), std::strong_ordering::greater);      // 'x' > '5'
-    EXPECT_EQ(compareVersionString("beta2", "beta10"), std::strong_ordering::less);
-    EXPECT_EQ(compareVersionString("\xc3\xa9", "z"), std::strong_ordering::greater);   // bytes, unsigned
+TEST(CompareVersionString, DigitRunsByValueOtherBytesLiterallyLeadingZerosLast) {
+    using std::strong_ordering;
+    const std::tuple<const char*, const char*, strong_ordering> cases[] = {
+        {"2.10", "2.9", strong_ordering::greater},
+        {"10", "9", strong_ordering::greater},
+        {"1.0", "1.0", strong_ordering::equal},
+        {"1.2.3", "1.2.10", strong_ordering::less},
+        {"", "", strong_ordering::equal},
+        // Runs longer than any integer type.
+        {"1.123456789012345678901234567890", "1.123456789012345678901234567889", strong_ordering::greater},
+        {"99999999999999999999999", "100000000000000000000000", strong_ordering::less},
+        {"18446744073709551616", "18446744073709551616", strong_ordering::equal},
+        // Leading zeros only break ties: fewer first, never against the numeric order.
+        {"1.1", "1.01", strong_ordering::less},
+        {"1.01", "1.001", strong_ordering::less},
+        {"0", "00", strong_ordering::less},
+        {"1.01", "1.2", strong_ordering::less},
+        {"1.01.9", "1.1.8", strong_ordering::greater},
+        {"01.1", "1.2", strong_ordering::less},
+        {"1.01.1", "1.1.001", strong_ordering::greater},  // the first run that differs in zeros decides
+        // Other characters compare literally, as unsigned bytes; a prefix first.
+        {"1.0a", "1.0b", strong_ordering::less},
+        {"1.0B", "1.0a", strong_ordering::less},
+        {"1.0", "1.0.1", strong_ordering::less},
+        {"1.0", "1.0a", strong_ordering::less},
+        {"1-beta", "1.beta", strong_ordering::less},
+        {"1.x", "1.5", strong_ordering::greater},
+        {"beta2", "beta10", strong_ordering::less},
+        {"\xc3\xa9", "z", strong_ordering::greater},
+    };
+    for (const auto& [a, b, order] : cases) {
+        EXPECT_EQ(compareVersionString(a, b), order) << a << " vs " << b;
+        EXPECT_EQ(compareVersionString(b, a), 0 <=> order) << b << " vs " << a;
+    }
 }
 
 TEST(CompareVersionString, IsAStrictTotalOrder) {
@@ -95,11 +79,9 @@ TEST(CompareVersionString, IsAStrictTotalOrder) {
                                       "1.01", "1.10", "1.9", "2", "2.0", "10", "9", "a", "a1", "a01", "a10",
                                       "1.01.9", "1.1.8", "1-1", "1..1", "\xc3\xa9", "1.2.3b4"};
     for (const auto& a : versions) {
-        EXPECT_EQ(compareVersionString(a, a), std::strong_ordering::equal) << a;
         for (const auto& b : versions) {
             auto ab = compareVersionString(a, b);
-            auto ba = compareVersionString(b, a);
-            EXPECT_EQ(ab, 0 <=> (ba <=> 0)) << a << " vs " << b;
+            EXPECT_EQ(ab, 0 <=> (compareVersionString(b, a) <=> 0)) << a << " vs " << b;
             EXPECT_EQ(ab == 0, a == b) << a << " vs " << b;
             for (const auto& c : versions) {
                 if (ab < 0 && compareVersionString(b, c) < 0) {
@@ -111,22 +93,17 @@ TEST(CompareVersionString, IsAStrictTotalOrder) {
 }
 
 TEST(QMGetDuct, TypedReadsGiveTheValueOnlyWhenItHasThatType) {
-    qm::Value message(qm::Dictionary{{"list", qm::Value(qm::Array{qm::Value(1)})},
-                                     {"rules", qm::Value(qm::Dictionary{{"k", qm::Value("v")}})},
-                                     {"text", qm::Value("x")}});
-    const qm::Array* list = QMGetDuctArray(message, "list");
-    ASSERT_TRUE(list);
-    EXPECT_EQ(list->size(), 1u);
-    const qm::Dictionary* rules = QMGetDuctDictionary(message, "rules");
-    ASSERT_TRUE(rules);
-    EXPECT_TRUE(rules->contains("k"));
-
+    Value message(Dictionary{{"list", Value(Array{1})}, {"rules", Value(Dictionary{{"k", "v"}})}, {"text", "x"}});
+    ASSERT_TRUE(QMGetDuctArray(message, "list"));
+    EXPECT_EQ(*QMGetDuctArray(message, "list"), Array{1});
+    ASSERT_TRUE(QMGetDuctDictionary(message, "rules"));
+    EXPECT_TRUE(QMGetDuctDictionary(message, "rules")->contains("k"));
     EXPECT_FALSE(QMGetDuctArray(message, "rules"));
     EXPECT_FALSE(QMGetDuctDictionary(message, "list"));
     EXPECT_FALSE(QMGetDuctArray(message, "text"));
     EXPECT_FALSE(QMGetDuctDictionary(message, "missing"));
-    EXPECT_FALSE(QMGetDuctArray(qm::Value(qm::Array{}), "list"));
-    EXPECT_FALSE(QMGetDuctDictionary(qm::Value(), "rules"));
+    EXPECT_FALSE(QMGetDuctArray(Value(Array{}), "list"));
+    EXPECT_FALSE(QMGetDuctDictionary(Value(), "rules"));
 }
 
 }  // namespace

@@ -8,9 +8,9 @@
 #include <mutex>
 #include <thread>
 
+#include "platform/duct/Frame.h"
 #include "platform/duct/Listener.h"
-#include "platform/duct/ServiceSocket.h"
-#include "support/RawClient.h"
+#include "support/FramePeer.h"
 #include "support/ScopedEnvironment.h"
 #include "support/TempDir.h"
 
@@ -19,6 +19,7 @@ namespace {
 using qm::duct::ConnectionEvent;
 using qm::duct::IncomingMessage;
 using qm::duct::PeerConnection;
+using qmtest::FramePeer;
 
 // A listener on its own loop thread; every message is kept for the test to
 // answer, every invalid event recorded.
@@ -70,12 +71,13 @@ public:
         messages_.pop_front();
         return m;
     }
-    std::optional<std::string> waitForInvalid(std::chrono::milliseconds timeout = std::chrono::seconds(5)) {
+    // The reason of the n-th connection's end, in the order they ended.
+    std::optional<std::string> waitForInvalid(std::size_t n = 0) {
         std::unique_lock lock(mutex_);
-        if (!changed_.wait_for(lock, timeout, [&] { return !invalidReasons_.empty(); })) {
+        if (!changed_.wait_for(lock, std::chrono::seconds(5), [&] { return invalidReasons_.size() > n; })) {
             return std::nullopt;
         }
-        return invalidReasons_.front();
+        return invalidReasons_[n];
     }
     std::shared_ptr<PeerConnection> connection(std::size_t i) {
         std::lock_guard lock(mutex_);
@@ -102,7 +104,7 @@ qm::Value numbered(int i) {
 
 TEST(DuctTransport, PeersAreIdentifiedByTheirCredentials) {
     Harness harness;
-    qmtest::RawClient client(harness.socketPath());
+    FramePeer client(harness.socketPath());
     client.send(numbered(1));
     ASSERT_TRUE(harness.waitForMessages(1));
     auto connection = harness.connection(0);
@@ -115,7 +117,7 @@ TEST(DuctTransport, PeersAreIdentifiedByTheirCredentials) {
 
 TEST(DuctTransport, AtMostSixtyFourRequestsAreReadBeforeRepliesGoOut) {
     Harness harness;
-    qmtest::RawClient client(harness.socketPath());
+    FramePeer client(harness.socketPath());
     for (int i = 0; i < 100; ++i) {
         client.send(numbered(i));
     }
@@ -141,7 +143,7 @@ TEST(DuctTransport, AtMostSixtyFourRequestsAreReadBeforeRepliesGoOut) {
 
 TEST(DuctTransport, ALargeReplyReachesASlowReaderWhole) {
     Harness harness;
-    qmtest::RawClient client(harness.socketPath());
+    FramePeer client(harness.socketPath());
     client.send(numbered(1));
     ASSERT_TRUE(harness.waitForMessages(1));
     qm::Bytes blob(3 * 1024 * 1024);
@@ -157,7 +159,7 @@ TEST(DuctTransport, ALargeReplyReachesASlowReaderWhole) {
 
 TEST(DuctTransport, ABacklogBeyondFourMebibytesClosesTheConnection) {
     Harness harness;
-    qmtest::RawClient client(harness.socketPath());
+    FramePeer client(harness.socketPath());
     for (int i = 0; i < 10; ++i) {
         client.send(numbered(i));
     }
@@ -178,7 +180,7 @@ TEST(DuctTransport, AHangUpIsReportedOnceAndRepliesAfterItAreDropped) {
     Harness harness;
     std::optional<IncomingMessage> pending;
     {
-        qmtest::RawClient client(harness.socketPath());
+        FramePeer client(harness.socketPath());
         client.send(numbered(1));
         ASSERT_TRUE(harness.waitForMessages(1));
         pending.emplace(harness.takeMessage());
@@ -187,6 +189,62 @@ TEST(DuctTransport, AHangUpIsReportedOnceAndRepliesAfterItAreDropped) {
     ASSERT_TRUE(reason);
     EXPECT_EQ(*reason, "peer hung up");
     EXPECT_FALSE(pending->reply(numbered(2)));
+}
+
+// Framing and payload errors close the connection at once, with the reason,
+// and touch no other connection. What the codec refuses is listed in its own
+// tests; one refusal here shows the path.
+TEST(DuctTransport, BrokenFramesCloseOnlyTheirOwnConnection) {
+    Harness harness;
+    FramePeer bystander(harness.socketPath());
+    struct Case {
+        const char* what;
+        qm::Bytes bytes;
+        const char* reason;
+    };
+    const Case cases[] = {
+        // Only the header: the payload is not waited for.
+        {"header over 16 MiB", qmtest::frameHeader(16 * 1024 * 1024 + 1, 1, 1),
+         "frame announces 16777217 bytes, over the 16 MiB limit"},
+        {"reply kind from a client", qmtest::rawFrame("\xa0", 2), "frame of kind 2 from a client"},
+        {"unknown kind", qmtest::rawFrame("\xa0", 7), "frame of kind 7 from a client"},
+        {"undecodable payload", qmtest::rawFrame("\xa1\x61k"), "invalid payload: truncated item"},
+        {"hostile nesting", qmtest::rawFrame(std::string(100000, '\x81') + "\x80"),
+         "invalid payload: nesting deeper than 512 levels"},
+    };
+    for (std::size_t i = 0; i < std::size(cases); ++i) {
+        SCOPED_TRACE(cases[i].what);
+        FramePeer attacker(harness.socketPath());
+        ASSERT_TRUE(attacker.sendBytes(cases[i].bytes));
+        EXPECT_TRUE(attacker.waitForClose());
+        EXPECT_EQ(harness.waitForInvalid(i), cases[i].reason);
+        bystander.send(numbered(static_cast<int>(i)));
+        ASSERT_TRUE(harness.waitForMessages(i + 1));
+    }
+    EXPECT_TRUE(harness.connection(0)->isValid());
+}
+
+TEST(DuctTransport, FramesArePiecedTogetherUpToExactlyTheLimit) {
+    Harness harness;
+    FramePeer client(harness.socketPath());
+    auto small = qm::duct::encodeFrame(qm::duct::FrameKind::message, 42, numbered(1));
+    ASSERT_TRUE(small);
+    for (std::uint8_t byte : *small) {
+        ASSERT_TRUE(client.sendBytes(qm::Bytes{byte}));
+        std::this_thread::sleep_for(std::chrono::microseconds(200));
+    }
+    ASSERT_TRUE(harness.waitForMessages(1));
+    IncomingMessage first = harness.takeMessage();
+    EXPECT_EQ(first.id(), 42u);
+    EXPECT_EQ(first.body(), numbered(1));
+    // {"x": h'...'}: map head 1, key 2, byte-string head 5 bytes, then the data.
+    qm::Value big(qm::Dictionary{{"x", qm::Value(qm::Bytes(qm::duct::kMaxPayloadSize - 8, 0x7a))}});
+    auto limit = qm::duct::encodeFrame(qm::duct::FrameKind::message, 43, big);
+    ASSERT_TRUE(limit);
+    ASSERT_EQ(limit->size(), qm::duct::kFrameHeaderSize + qm::duct::kMaxPayloadSize);
+    ASSERT_TRUE(client.sendBytes(*limit));
+    ASSERT_TRUE(harness.waitForMessages(1, std::chrono::seconds(20)));
+    EXPECT_EQ(harness.takeMessage().body(), big);
 }
 
 }  // namespace

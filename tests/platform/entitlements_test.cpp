@@ -4,11 +4,9 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <mutex>
+#include <functional>
 #include <string>
-#include <vector>
 
-#include "platform/log/SystemLog.h"
 #include "platform/plist/PropertyList.h"
 #include "support/LogCapture.h"
 #include "support/TempDir.h"
@@ -19,129 +17,93 @@ using qmtest::LogCapture;
 
 constexpr uid_t kNobody = 65534;
 
-const qm::Value kGranted(qm::Dictionary{{"ovaro.developer.replace-plugin", qm::Value(true)},
-                                        {"ovaro.developer.quamber.allowedplugins",
-                                         qm::Value(qm::Array{qm::Value("com.example.a")})}});
+const qm::Value kGranted(qm::Dictionary{{"ovaro.developer.replace-plugin", true},
+                                        {"ovaro.developer.quamber.allowedplugins", qm::Value(qm::Array{"com.example.a"})}});
 
 // A bundle whose info folder and Entitlements.plist have trustworthy modes.
-class EntitlementsTest : public ::testing::Test {
-protected:
-    void makeBundle(bool desktopStyle) {
-        bundlePath = dir.file(desktopStyle ? "Desk.app" : "Flat.app");
-        infoFolder = desktopStyle ? bundlePath + "/Contents" : bundlePath;
+struct Bundle {
+    explicit Bundle(bool desktopStyle) {
+        path = dir.file(desktopStyle ? "Desk.app" : "Flat.app");
+        infoFolder = desktopStyle ? path + "/Contents" : path;
+        entitlements = infoFolder + "/Entitlements.plist";
         qmtest::writeFile(infoFolder + "/Info.plist", "");
-        ASSERT_FALSE(qm::plist::writeFileAtomically(infoFolder + "/Info.plist",
-                                                    qm::Value(qm::Dictionary{{"MRBundleIdentifier", qm::Value("x")}}),
+        EXPECT_FALSE(qm::plist::writeFileAtomically(infoFolder + "/Info.plist", qm::Value(qm::Dictionary{{"MRBundleIdentifier", "x"}}),
                                                     qm::plist::Format::xml));
-        entitlementsPath = infoFolder + "/Entitlements.plist";
-        writeEntitlements(kGranted);
-        ASSERT_EQ(::chmod(infoFolder.c_str(), 0755), 0);
-        ASSERT_EQ(::chmod(entitlementsPath.c_str(), 0644), 0);
-        auto directory = qm::BundleDirectory::atPath(bundlePath);
-        ASSERT_TRUE(directory);
-        bundle = *directory;
+        write(kGranted);
+        EXPECT_EQ(::chmod(infoFolder.c_str(), 0755), 0);
     }
-    void SetUp() override { makeBundle(false); }
-
-    void writeEntitlements(const qm::Value& value) {
-        ASSERT_FALSE(qm::plist::writeFileAtomically(entitlementsPath, value, qm::plist::Format::xml));
-        ASSERT_EQ(::chmod(entitlementsPath.c_str(), 0644), 0);
+    void write(const qm::Value& value) {
+        EXPECT_FALSE(qm::plist::writeFileAtomically(entitlements, value, qm::plist::Format::xml));
+        EXPECT_EQ(::chmod(entitlements.c_str(), 0644), 0);
     }
-
-    // Reads the entitlements and expects none, with exactly one log line naming the problem.
-    void expectRefused(const std::string& expectedInLog) {
-        LogCapture log;
-        EXPECT_FALSE(qm::readEntitlements(*bundle));
-        auto lines = log.lines();
-        ASSERT_EQ(lines.size(), 1u);
-        EXPECT_NE(lines[0].find(expectedInLog), std::string::npos) << lines[0];
-    }
+    std::optional<qm::Value> read() const { return qm::readEntitlements(*qm::BundleDirectory::atPath(path)); }
 
     qmtest::TempDir dir;
-    std::string bundlePath;
-    std::string infoFolder;
-    std::string entitlementsPath;
-    std::optional<qm::BundleDirectory> bundle;
+    std::string path, infoFolder, entitlements;
 };
 
-TEST_F(EntitlementsTest, TrustedFileIsHonoured) {
-    LogCapture log;
-    auto entitlements = qm::readEntitlements(*bundle);
-    ASSERT_TRUE(entitlements);
-    EXPECT_EQ(*entitlements, kGranted);
-    EXPECT_TRUE(log.lines().empty());
-}
-
-TEST_F(EntitlementsTest, DesktopStyleBundlesKeepThemInContents) {
-    makeBundle(true);
-    ASSERT_EQ(bundle->infoFolder(), bundlePath + "/Contents");
-    auto entitlements = qm::readEntitlements(*bundle);
-    ASSERT_TRUE(entitlements);
-    EXPECT_EQ(*entitlements, kGranted);
-}
-
-TEST_F(EntitlementsTest, NoFileMeansNoEntitlementsSilently) {
-    ASSERT_EQ(::unlink(entitlementsPath.c_str()), 0);
-    LogCapture log;
-    EXPECT_FALSE(qm::readEntitlements(*bundle));
-    EXPECT_TRUE(log.lines().empty());
-}
-
-TEST_F(EntitlementsTest, GroupWritableFolderIsNotHonoured) {
-    ASSERT_EQ(::chmod(infoFolder.c_str(), 0775), 0);
-    expectRefused("writable by group or others");
-}
-
-TEST_F(EntitlementsTest, WorldWritableFolderIsNotHonoured) {
-    ASSERT_EQ(::chmod(infoFolder.c_str(), 0757), 0);
-    expectRefused("writable by group or others");
-}
-
-TEST_F(EntitlementsTest, GroupOrWorldWritableFileIsNotHonoured) {
-    ASSERT_EQ(::chmod(entitlementsPath.c_str(), 0664), 0);
-    expectRefused("writable by group or others");
-    ASSERT_EQ(::chmod(entitlementsPath.c_str(), 0646), 0);
-    expectRefused("writable by group or others");
-}
-
-TEST_F(EntitlementsTest, SymbolicLinkIsNotFollowed) {
-    std::string elsewhere = dir.file("trusted-elsewhere.plist");
-    ASSERT_EQ(::rename(entitlementsPath.c_str(), elsewhere.c_str()), 0);
-    ASSERT_EQ(::symlink(elsewhere.c_str(), entitlementsPath.c_str()), 0);
-    expectRefused("symbolic link");
-}
-
-TEST_F(EntitlementsTest, AFolderInPlaceOfTheFileIsNotHonoured) {
-    ASSERT_EQ(::unlink(entitlementsPath.c_str()), 0);
-    ASSERT_EQ(::mkdir(entitlementsPath.c_str(), 0755), 0);
-    expectRefused("not a regular file");
-}
-
-TEST_F(EntitlementsTest, FileOwnedByAnotherUserIsNotHonoured) {
-    if (::geteuid() != 0) {
-        GTEST_SKIP() << "changing a file's owner needs root";
+TEST(Entitlements, ATrustedFileBesideEitherLayoutsInfoIsHonouredSilently) {
+    for (bool desktopStyle : {false, true}) {
+        Bundle bundle(desktopStyle);
+        LogCapture log;
+        EXPECT_EQ(bundle.read(), kGranted);
+        EXPECT_TRUE(log.lines().empty()) << log.text();
+        ASSERT_EQ(::unlink(bundle.entitlements.c_str()), 0);
+        EXPECT_EQ(bundle.read(), std::nullopt) << "no file: no entitlements, and nothing to say";
+        EXPECT_TRUE(log.lines().empty()) << log.text();
     }
-    ASSERT_EQ(::chown(entitlementsPath.c_str(), kNobody, kNobody), 0);
-    expectRefused("owned by uid 65534");
 }
 
-TEST_F(EntitlementsTest, FolderOwnedByAnotherUserIsNotHonoured) {
-    if (::geteuid() != 0) {
-        GTEST_SKIP() << "changing a folder's owner needs root";
+// An untrusted or unreadable file gives no entitlements and exactly one line.
+TEST(Entitlements, AFileThatCannotBeTrustedIsRefusedWithOneLine) {
+    struct Case {
+        const char* what;
+        std::function<void(Bundle&)> spoil;
+        const char* logged;
+        bool needsRoot = false;
+    };
+    const Case cases[] = {
+        {"group-writable folder", [](Bundle& b) { ::chmod(b.infoFolder.c_str(), 0775); }, "writable by group or others"},
+        {"world-writable folder", [](Bundle& b) { ::chmod(b.infoFolder.c_str(), 0757); }, "writable by group or others"},
+        {"group-writable file", [](Bundle& b) { ::chmod(b.entitlements.c_str(), 0664); }, "writable by group or others"},
+        {"world-writable file", [](Bundle& b) { ::chmod(b.entitlements.c_str(), 0646); }, "writable by group or others"},
+        {"symbolic link",
+         [](Bundle& b) {
+             std::string elsewhere = b.dir.file("trusted-elsewhere.plist");
+             ::rename(b.entitlements.c_str(), elsewhere.c_str());
+             ::symlink(elsewhere.c_str(), b.entitlements.c_str());
+         },
+         "symbolic link"},
+        {"a folder in its place",
+         [](Bundle& b) {
+             ::unlink(b.entitlements.c_str());
+             ::mkdir(b.entitlements.c_str(), 0755);
+         },
+         "not a regular file"},
+        {"not a dictionary", [](Bundle& b) { b.write(qm::Value(qm::Array{"ovaro.developer.replace-plugin"})); }, "not a dictionary"},
+        {"broken",
+         [](Bundle& b) {
+             qmtest::writeFile(b.entitlements, "<plist version=\"1.0\"><dict><key>oops</key>");
+             ::chmod(b.entitlements.c_str(), 0644);
+         },
+         "entitlements unreadable"},
+        {"file of another user", [](Bundle& b) { EXPECT_EQ(::chown(b.entitlements.c_str(), kNobody, kNobody), 0); },
+         "owned by uid 65534", true},
+        {"folder of another user", [](Bundle& b) { EXPECT_EQ(::chown(b.infoFolder.c_str(), kNobody, kNobody), 0); },
+         "owned by uid 65534", true},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.what);
+        if (c.needsRoot && ::geteuid() != 0) {
+            continue;  // changing an owner needs root
+        }
+        Bundle bundle(false);
+        c.spoil(bundle);
+        LogCapture log;
+        EXPECT_EQ(bundle.read(), std::nullopt);
+        ASSERT_EQ(log.lines().size(), 1u) << log.text();
+        EXPECT_NE(log.lines()[0].find(c.logged), std::string::npos) << log.lines()[0];
     }
-    ASSERT_EQ(::chown(infoFolder.c_str(), kNobody, kNobody), 0);
-    expectRefused("owned by uid 65534");
-}
-
-TEST_F(EntitlementsTest, ContentThatIsNotADictionaryIsRefusedWithALogLine) {
-    writeEntitlements(qm::Value(qm::Array{qm::Value("ovaro.developer.replace-plugin")}));
-    expectRefused("not a dictionary");
-}
-
-TEST_F(EntitlementsTest, BrokenFileIsRefusedWithALogLine) {
-    qmtest::writeFile(entitlementsPath, "<plist version=\"1.0\"><dict><key>oops</key>");
-    ASSERT_EQ(::chmod(entitlementsPath.c_str(), 0644), 0);
-    expectRefused("entitlements unreadable");
 }
 
 }  // namespace

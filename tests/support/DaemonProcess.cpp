@@ -10,7 +10,7 @@
 #include <filesystem>
 #include <thread>
 
-#include "support/RawClient.h"
+#include "support/FramePeer.h"
 
 namespace qmtest {
 
@@ -92,12 +92,9 @@ DaemonProcess::DaemonProcess(DaemonOptions options) : serviceName_(options.servi
         ::_exit(127);
     }
     ::close(logFd);
-    if (!options.waitForSocket) {
-        return;
-    }
     auto deadline = Clock::now() + std::chrono::seconds(10);
     while (Clock::now() < deadline) {
-        if (RawClient::tryConnect(socketPath())) {
+        if (FramePeer::canConnect(socketPath())) {
             return;
         }
         if (!running()) {

@@ -18,7 +18,6 @@ struct DaemonOptions {
     std::vector<std::string> arguments;              // after the program name
     std::map<std::string, std::string> environment;  // added to (or replacing) the test's own
     std::string serviceName = "qmtest.qmd";
-    bool waitForSocket = true;
 };
 
 inline DaemonOptions withArguments(std::vector<std::string> arguments) {
@@ -44,7 +43,6 @@ public:
     const std::string& runtimeDirectory() const { return runtimeDirectory_; }
     std::string socketPath() const { return runtimeDirectory_ + "/" + serviceName_; }
     const std::string& serviceName() const { return serviceName_; }
-    const TempDir& scratch() const { return scratch_; }
 
     // What the daemon wrote to standard error so far (its log, QM_LOG_STDERR=1).
     std::string log() const;

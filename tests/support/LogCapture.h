@@ -35,6 +35,7 @@ public:
         }
         return all;
     }
+    bool contains(const std::string& needle) const { return text().find(needle) != std::string::npos; }
     std::size_t countContaining(const std::string& needle) const {
         std::size_t count = 0;
         for (const auto& line : lines()) {
@@ -42,7 +43,6 @@ public:
         }
         return count;
     }
-    bool contains(const std::string& needle) const { return countContaining(needle) > 0; }
     // Waits up to five seconds for a line holding the text.
     bool waitFor(const std::string& needle) const {
         for (int i = 0; i < 500; ++i) {
