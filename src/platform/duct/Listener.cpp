@@ -28,9 +28,12 @@ bool isListeningStreamSocket(int fd) {
 }  // namespace
 
 Result<std::shared_ptr<Listener>> Listener::create(EventLoop& loop, const std::string& serviceName,
-                                                   SerialQueue& eventQueue) {
+                                                   SerialQueue& eventQueue, std::shared_ptr<ReceiveBudget> budget) {
     if (auto path = serviceSocketPath(serviceName); !path) {
         return path.error();
+    }
+    if (!budget) {
+        budget = std::make_shared<ReceiveBudget>(loop);
     }
     auto activated = takeSocketActivationDescriptors();
     if (!activated.empty()) {
@@ -44,19 +47,21 @@ Result<std::shared_ptr<Listener>> Listener::create(EventLoop& loop, const std::s
         int flags = ::fcntl(socket.get(), F_GETFL);
         ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK);
         ::fcntl(socket.get(), F_SETFD, FD_CLOEXEC);
-        return std::shared_ptr<Listener>(new Listener(loop, serviceName, eventQueue, std::move(socket), UniqueFd()));
+        return std::shared_ptr<Listener>(
+            new Listener(loop, serviceName, eventQueue, std::move(socket), UniqueFd(), std::move(budget)));
     }
     auto claimed = openServiceSocket(serviceName);
     if (!claimed) {
         return claimed.error();
     }
     return std::shared_ptr<Listener>(new Listener(loop, serviceName, eventQueue, std::move(claimed->listener),
-                                                  std::move(claimed->lock)));
+                                                  std::move(claimed->lock), std::move(budget)));
 }
 
-Listener::Listener(EventLoop& loop, std::string serviceName, SerialQueue& eventQueue, UniqueFd socket, UniqueFd lock)
+Listener::Listener(EventLoop& loop, std::string serviceName, SerialQueue& eventQueue, UniqueFd socket, UniqueFd lock,
+                   std::shared_ptr<ReceiveBudget> budget)
     : loop_(loop), serviceName_(std::move(serviceName)), eventQueue_(eventQueue), socket_(std::move(socket)),
-      lock_(std::move(lock)) {}
+      lock_(std::move(lock)), budget_(std::move(budget)) {}
 
 Listener::~Listener() = default;
 
@@ -93,8 +98,10 @@ void Listener::acceptPending() {
             }
             return;  // EAGAIN, or a peer that gave up before we took it
         }
+        // Right after accept, before the peer can exit and its pid be reused.
+        auto identity = capturePeerIdentity(peer.get());
         std::weak_ptr<Listener> weakSelf = weak_from_this();
-        auto connection = PeerConnection::adopt(loop_, std::move(peer), [weakSelf] {
+        auto connection = PeerConnection::adopt(loop_, std::move(peer), std::move(identity), budget_, [weakSelf] {
             if (auto self = weakSelf.lock()) {
                 self->resumeAccepting();
             }
@@ -112,7 +119,9 @@ void Listener::pauseAccepting() {
         return;
     }
     paused_ = true;
-    (void)loop_.modify(registration_, socket_.get(), 0);
+    if (auto error = loop_.modify(registration_, socket_.get(), 0)) {
+        systemLogf(kLogNotice, "cannot pause accepting connections: %@", error->text());
+    }
     // Retry after a while even if no connection closes (another process may free descriptors).
     loop_.postAfter(std::chrono::seconds(1), [weakSelf = weak_from_this()] {
         if (auto self = weakSelf.lock()) {
@@ -126,7 +135,9 @@ void Listener::resumeAccepting() {
         return;
     }
     paused_ = false;
-    (void)loop_.modify(registration_, socket_.get(), EPOLLIN);
+    if (auto error = loop_.modify(registration_, socket_.get(), EPOLLIN)) {
+        systemLogf(kLogNotice, "cannot resume accepting connections: %@", error->text());
+    }
 }
 
 }  // namespace qm::duct
