@@ -10,7 +10,7 @@
 
 #include <poll.h>
 
-#include <condition_variable>
+#include <algorithm>
 #include <deque>
 #include <functional>
 #include <list>
@@ -146,9 +146,12 @@ public:
         }
         return senders;
     }
-    IncomingMessage takeMessage(std::size_t index = 0) {
+    // The first message from that peer (from any, by default).
+    IncomingMessage takeMessage(int from = -1) {
         std::lock_guard lock(mutex_);
-        auto it = std::next(messages_.begin(), static_cast<std::ptrdiff_t>(index));
+        auto it = std::find_if(messages_.begin(), messages_.end(),
+                               [&](const auto& entry) { return from < 0 || entry.first == from; });
+        EXPECT_NE(it, messages_.end());
         IncomingMessage message = std::move(it->second);
         messages_.erase(it);
         return message;
@@ -242,32 +245,28 @@ TEST(PeerTransport, WaitingConnectionsResumeInOrderOnceTheStalledLargestHolderIs
     EXPECT_EQ(server.budget().waiting(Pool::partial), 0u);
 }
 
-TEST(PeerTransport, ADecodedRequestWaitsForTheBudgetWhileOthersAreServed) {
-    // Each 10 KiB request may decode to 160 KiB, more than the pool: only a
-    // connection with nothing in flight is admitted.
-    Server server(ReceiveLimits{.decodedBytes = 100 * 1024});
+// Two requests of 10 KiB: each may decode to 160 KiB, more than a 100 KiB
+// pool, so the second waits until the first is answered.
+Bytes twoRequests() {
     Bytes two = request(1, 10 * 1024);
     Bytes second = request(2, 10 * 1024);
     two.insert(two.end(), second.begin(), second.end());
-    auto& greedy = server.connect(two);
+    return two;
+}
+
+TEST(PeerTransport, ADecodedRequestWaitsUntilAnAnswerMakesRoom) {
+    Server server(ReceiveLimits{.decodedBytes = 100 * 1024});
+    server.connect(twoRequests());
     ASSERT_TRUE(eventually([&] { return server.messageCount() == 1 && server.budget().waiting(Pool::decoded) == 1; }));
     EXPECT_GT(server.budget().decodedBytes(), 10u * 1024);
-
-    auto& other = server.connect(request(9, 10 * 1024));
-    ASSERT_TRUE(eventually([&] { return server.messageCount() == 2; }));
-    EXPECT_EQ(server.takeMessage(1).reply(Value(qm::Dictionary{})), ReplyResult::sent);
-    auto reply = readReply(other.end.get());
-    ASSERT_TRUE(reply);
-    EXPECT_EQ(reply->first, 9u);
-
     EXPECT_EQ(server.takeMessage().reply(Value(qm::Dictionary{})), ReplyResult::sent);
     ASSERT_TRUE(eventually([&] { return server.messageCount() == 1; }));
-    EXPECT_EQ(server.messageSenders(), std::vector<int>{greedy.number});
+    EXPECT_EQ(server.budget().waiting(Pool::decoded), 0u);
     server.dropMessages();
     EXPECT_EQ(server.budget().decodedBytes(), 0u);
 }
 
-TEST(PeerTransport, HangUpsAreSeenWhileReadingWaits) {
+TEST(PeerTransport, WhileAConnectionWaitsOthersAreServedAndItsHangUpIsSeen) {
     struct Case {
         const char* what;
         ReceiveLimits limits;
@@ -277,19 +276,26 @@ TEST(PeerTransport, HangUpsAreSeenWhileReadingWaits) {
     };
     Bytes hoard = header(2000, 1);
     hoard.resize(hoard.size() + 1100, 0x61);
-    Bytes two = request(1, 10 * 1024);
-    Bytes second = request(2, 10 * 1024);
-    two.insert(two.end(), second.begin(), second.end());
     const Case cases[] = {
         {"partial pool", ReceiveLimits{.partialBytes = 1000, .stallTimeout = 60s}, Pool::partial,
          [&](Server& server) { server.connect(hoard); }, request(1, 5000)},
-        {"decoded pool", ReceiveLimits{.decodedBytes = 100 * 1024}, Pool::decoded, [](Server&) {}, two},
+        {"decoded pool", ReceiveLimits{.decodedBytes = 100 * 1024}, Pool::decoded, [](Server&) {}, twoRequests()},
     };
     for (const auto& c : cases) {
         Server server(c.limits);
         c.fill(server);
         auto& victim = server.connect(c.victim);
         ASSERT_TRUE(eventually([&] { return server.budget().waiting(c.pool) == 1; })) << c.what;
+        // A connection holding nothing and with nothing in flight is admitted.
+        auto& bystander = server.connect(request(9, 10));
+        ASSERT_TRUE(eventually([&] {
+            auto senders = server.messageSenders();
+            return std::find(senders.begin(), senders.end(), bystander.number) != senders.end();
+        })) << c.what;
+        EXPECT_EQ(server.takeMessage(bystander.number).reply(Value(qm::Dictionary{})), ReplyResult::sent);
+        auto reply = readReply(bystander.end.get());
+        ASSERT_TRUE(reply) << c.what;
+        EXPECT_EQ(reply->first, 9u) << c.what;
         // Only half closed: nothing but EPOLLRDHUP tells.
         ::shutdown(victim.end.get(), SHUT_WR);
         ASSERT_TRUE(eventually([&] { return server.invalidReason(victim.number).has_value(); })) << c.what;
