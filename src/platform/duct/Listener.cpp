@@ -134,10 +134,17 @@ void Listener::resumeAccepting() {
     if (!paused_) {
         return;
     }
-    paused_ = false;
     if (auto error = loop_.modify(registration_, socket_.get(), EPOLLIN)) {
-        systemLogf(kLogNotice, "cannot resume accepting connections: %@", error->text());
+        // Still paused: the next closed connection, or this retry, tries again.
+        systemLogf(kLogNotice, "cannot resume accepting connections, retrying in a second: %@", error->text());
+        loop_.postAfter(std::chrono::seconds(1), [weakSelf = weak_from_this()] {
+            if (auto self = weakSelf.lock()) {
+                self->resumeAccepting();
+            }
+        });
+        return;
     }
+    paused_ = false;
 }
 
 }  // namespace qm::duct
