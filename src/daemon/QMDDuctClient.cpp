@@ -10,11 +10,19 @@ namespace {
 // with the count follows when it closes.
 constexpr unsigned kLoggedUnexpectedMessages = 10;
 
+// The transport fixed the peer at accept; the bundle and its entitlements are
+// read once, here, from the executable checked against the pidfd then. A
+// connection without an identity never delivers a request.
 ClientIdentity identityOf(const qm::duct::PeerConnection& connection) {
     ClientIdentity identity;
-    identity.pid = connection.credentials().pid;
-    identity.uid = connection.credentials().uid;
-    identity.executablePath = connection.peerExecutablePath();
+    identity.pid = connection.pid();
+    const auto& peer = connection.identity();
+    if (!peer) {
+        return identity;
+    }
+    identity.uid = peer->uid;
+    identity.pidfd = peer->pidfd;
+    identity.executablePath = peer->executablePath;
     if (identity.executablePath) {
         identity.bundle = QMBundle::initWithExecutablePath(*identity.executablePath);
     }

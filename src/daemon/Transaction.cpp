@@ -1,5 +1,6 @@
 #include "daemon/Transaction.h"
 
+#include <algorithm>
 #include <cassert>
 #include <string_view>
 
@@ -19,6 +20,18 @@ const std::string* requestName(const qm::Value& request) {
 std::uint64_t requestVersion(const qm::Value& request) {
     const qm::Value* value = request.get(wire::kVersion);
     return value ? value->asUnsigned().value_or(0) : 0;
+}
+
+// How many plug-ins a reply describes: the forms it carries under "matches"
+// (packed) or in any other array.
+int plugInCountOf(const qm::Value& reply) {
+    std::size_t count = 0;
+    for (const auto& [key, value] : *reply.asDictionary()) {
+        const qm::Value* content = value.packedContent();
+        const qm::Array* forms = (content ? *content : value).asArray();
+        count = std::max(count, forms ? forms->size() : 0);
+    }
+    return static_cast<int>(count);
 }
 
 }  // namespace
@@ -84,7 +97,15 @@ void Transaction::done() {
     if (server().verbose() >= 2) {
         server().logger().debugInFull("Replying %@", reply);
     }
-    request_.reply(reply);
+    if (request_.reply(reply) != qm::duct::ReplyResult::tooLarge) {
+        return;
+    }
+    // Nothing was sent: the client gets an error it can act on instead.
+    qm::Dictionary tooLarge{
+        {wire::kErrorCode, qm::Value(static_cast<std::uint64_t>(kQMErrorInvalidRequest))},
+        {wire::kError, qm::Value(qm::format("reply too large (%d plug-ins)", plugInCountOf(reply)))}};
+    server().log("reply to client %d too large: %@", client_->pid(), tooLarge.find(wire::kError)->asString());
+    request_.reply(qm::Value(std::move(tooLarge)));
 }
 
 void Transaction::fail(int code, std::optional<std::string> message) {

@@ -7,16 +7,21 @@
 
 #include <sys/types.h>
 
+#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
 
 #include "model/QMBundle.h"
+#include "platform/fd/UniqueFd.h"
 #include "platform/value/Value.h"
 
 struct ClientIdentity {
     pid_t pid = 0;
     uid_t uid = 0;
+    // The process itself, taken at accept: /proc reads about the client are
+    // checked against it, so a recycled pid is never mistaken for it.
+    std::shared_ptr<const qm::UniqueFd> pidfd;
     std::optional<std::string> executablePath;
     // The bundle around the client's executable, when it runs from one.
     std::optional<QMBundle> bundle;

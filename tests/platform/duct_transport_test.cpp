@@ -19,6 +19,7 @@ namespace {
 using qm::duct::ConnectionEvent;
 using qm::duct::IncomingMessage;
 using qm::duct::PeerConnection;
+using qm::duct::ReplyResult;
 using qmtest::FramePeer;
 
 // A listener on its own loop thread; every message is kept for the test to
@@ -109,7 +110,8 @@ TEST(DuctTransport, PeersAreIdentifiedByTheirCredentials) {
     ASSERT_TRUE(harness.waitForMessages(1));
     auto connection = harness.connection(0);
     EXPECT_EQ(connection->pid(), ::getpid());
-    EXPECT_EQ(connection->credentials().uid, ::getuid());
+    ASSERT_TRUE(connection->identity());
+    EXPECT_EQ(connection->identity()->uid, ::getuid());
     auto exe = connection->peerExecutablePath();
     ASSERT_TRUE(exe);
     EXPECT_NE(exe->find("platform_duct_transport"), std::string::npos) << *exe;
@@ -125,7 +127,7 @@ TEST(DuctTransport, AtMostSixtyFourRequestsAreReadBeforeRepliesGoOut) {
     std::this_thread::sleep_for(std::chrono::milliseconds(100));
     EXPECT_EQ(harness.messageCount(), 64u);
     // Each answer, from another thread, lets exactly one more in.
-    std::thread([m = harness.takeMessage()]() mutable { EXPECT_TRUE(m.reply(qm::Value(qm::Dictionary{}))); }).join();
+    std::thread([m = harness.takeMessage()]() mutable { EXPECT_EQ(m.reply(qm::Value(qm::Dictionary{})), ReplyResult::sent); }).join();
     ASSERT_TRUE(harness.waitForMessages(64));
     std::this_thread::sleep_for(std::chrono::milliseconds(50));
     EXPECT_EQ(harness.messageCount(), 64u);
@@ -151,7 +153,7 @@ TEST(DuctTransport, ALargeReplyReachesASlowReaderWhole) {
         blob[i] = static_cast<std::uint8_t>(i * 7);
     }
     qm::Value big(qm::Dictionary{{"blob", qm::Value(blob)}});
-    EXPECT_TRUE(harness.takeMessage().reply(big));  // returns at once: the rest waits in the backlog
+    EXPECT_EQ(harness.takeMessage().reply(big), ReplyResult::sent);  // returns at once: the rest waits in the backlog
     auto reply = client.receive(std::chrono::seconds(20));
     ASSERT_TRUE(reply);
     EXPECT_EQ(reply->body, big);
@@ -167,7 +169,7 @@ TEST(DuctTransport, ABacklogBeyondFourMebibytesClosesTheConnection) {
     qm::Value megabyte(qm::Dictionary{{"blob", qm::Value(qm::Bytes(1024 * 1024))}});
     int accepted = 0;
     for (int i = 0; i < 10; ++i) {
-        accepted += harness.takeMessage().reply(megabyte) ? 1 : 0;
+        accepted += harness.takeMessage().reply(megabyte) == ReplyResult::sent ? 1 : 0;
     }
     EXPECT_LT(accepted, 10);
     auto reason = harness.waitForInvalid();
@@ -188,7 +190,7 @@ TEST(DuctTransport, AHangUpIsReportedOnceAndRepliesAfterItAreDropped) {
     auto reason = harness.waitForInvalid();
     ASSERT_TRUE(reason);
     EXPECT_EQ(*reason, "peer hung up");
-    EXPECT_FALSE(pending->reply(numbered(2)));
+    EXPECT_EQ(pending->reply(numbered(2)), ReplyResult::connectionGone);
 }
 
 // Framing and payload errors close the connection at once, with the reason,
@@ -234,9 +236,13 @@ TEST(DuctTransport, FramesArePiecedTogetherUpToExactlyTheLimit) {
         std::this_thread::sleep_for(std::chrono::microseconds(200));
     }
     ASSERT_TRUE(harness.waitForMessages(1));
-    IncomingMessage first = harness.takeMessage();
-    EXPECT_EQ(first.id(), 42u);
-    EXPECT_EQ(first.body(), numbered(1));
+    {
+        // Answered (here: dropped) first: a frame this large is decoded only
+        // while its connection has no request in flight.
+        IncomingMessage first = harness.takeMessage();
+        EXPECT_EQ(first.id(), 42u);
+        EXPECT_EQ(first.body(), numbered(1));
+    }
     // {"x": h'...'}: map head 1, key 2, byte-string head 5 bytes, then the data.
     qm::Value big(qm::Dictionary{{"x", qm::Value(qm::Bytes(qm::duct::kMaxPayloadSize - 8, 0x7a))}});
     auto limit = qm::duct::encodeFrame(qm::duct::FrameKind::message, 43, big);

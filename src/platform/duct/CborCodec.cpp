@@ -150,9 +150,34 @@ constexpr std::uint64_t kDateTag = 1;
 constexpr std::uint64_t kPackedTag = 24;
 constexpr std::uint64_t kUuidTag = 37;
 
-// Initial capacity granted to a container before its items arrive: a count
-// field is untrusted, so larger containers grow as their items turn up.
-constexpr std::size_t kMaxReservedItems = 256;
+// What a decoded tree allocates, as Value lays it out: each non-empty string,
+// data, array, dictionary and packed value is one shared block (the control
+// block beside the object), plus the heap storage of its contents. Empty ones
+// share one object and scalars live in their slot: they cost nothing more.
+constexpr std::size_t kSharedBlockOverhead = 2 * sizeof(void*);
+
+std::size_t stringStorage(std::size_t size) {
+    static const std::size_t inlineCapacity = std::string().capacity();
+    return size > inlineCapacity ? size + 1 : 0;
+}
+
+std::size_t textCost(std::size_t size) {
+    return size == 0 ? 0 : kSharedBlockOverhead + sizeof(std::string) + stringStorage(size);
+}
+
+std::size_t dataCost(std::size_t size) {
+    return size == 0 ? 0 : kSharedBlockOverhead + sizeof(Bytes) + size;
+}
+
+std::size_t arrayCost(std::uint64_t count) {
+    return count == 0 ? 0 : kSharedBlockOverhead + sizeof(Array) + count * sizeof(Value);
+}
+
+std::size_t mapCost(std::uint64_t count) {
+    return count == 0 ? 0 : kSharedBlockOverhead + sizeof(Dictionary) + count * sizeof(Dictionary::Entry);
+}
+
+constexpr std::size_t kPackedCost = kSharedBlockOverhead + sizeof(Value);
 
 // libcbor reports only "error" for heads it refuses; name the reason from the
 // initial byte.
@@ -229,9 +254,11 @@ Result<Dictionary> dictionaryFromEntries(std::vector<Dictionary::Entry> entries)
 // the same payload, so neither nesting nor packed content recurses.
 class StreamDecoder {
 public:
-    explicit StreamDecoder(std::span<const std::uint8_t> payload) : payload_(payload) {}
+    explicit StreamDecoder(std::span<const std::uint8_t> payload)
+        : payload_(payload), allowance_(decodedSizeBound(payload.size())) {}
 
     Result<Value> run();
+    std::size_t allocatedBytes() const { return allocated_; }
 
 private:
     enum class FrameKind : std::uint8_t { array, map, dateTag, packedTag, uuidTag };
@@ -263,6 +290,8 @@ private:
     MaybeError openContainer(FrameKind kind, std::uint64_t count, std::size_t bytesLeft);
     MaybeError openTag(std::uint64_t tag);
     MaybeError checkDepth() const;
+    // Counts bytes the tree is about to allocate; an error once past the allowance.
+    MaybeError charge(std::size_t bytes);
     // Whether the packed tag on top of the stack has had its byte string, so
     // that heads now belong to the item inside it.
     bool isPackedContentOpen() const { return segments_.back().baseDepth == frames_.size(); }
@@ -272,6 +301,8 @@ private:
     std::vector<Segment> segments_;
     std::vector<Frame> frames_;
     std::optional<Value> root_;
+    const std::size_t allowance_;
+    std::size_t allocated_ = 0;
 };
 
 Result<Value> StreamDecoder::run() {
@@ -348,9 +379,16 @@ MaybeError StreamDecoder::handle(const Event& event, std::size_t bytesLeft) {
             if (!utf8::isValid(text)) {
                 return cborError("text is not UTF-8");
             }
+            if (auto error = charge(textCost(text.size()))) {
+                return error;
+            }
             return deliver(Value(std::string(text)));
         }
-        case Event::Kind::byteString: return deliver(Value(Bytes(event.bytes, event.bytes + event.size)));
+        case Event::Kind::byteString:
+            if (auto error = charge(dataCost(event.size))) {
+                return error;
+            }
+            return deliver(Value(Bytes(event.bytes, event.bytes + event.size)));
         case Event::Kind::array: return openContainer(FrameKind::array, event.number, bytesLeft);
         case Event::Kind::map: return openContainer(FrameKind::map, event.number, bytesLeft);
         case Event::Kind::tag: return openTag(event.number);
@@ -370,6 +408,9 @@ MaybeError StreamDecoder::takeKey(Frame& map, const Event& event) {
     std::string_view key(reinterpret_cast<const char*>(event.bytes), event.size);
     if (!utf8::isValid(key)) {
         return cborError("text is not UTF-8");
+    }
+    if (auto error = charge(stringStorage(key.size()))) {
+        return error;
     }
     map.entries.emplace_back(std::string(key), Value());
     map.hasKey = true;
@@ -418,6 +459,15 @@ MaybeError StreamDecoder::enterPacked(const Event& event) {
     return std::nullopt;
 }
 
+MaybeError StreamDecoder::charge(std::size_t bytes) {
+    allocated_ += bytes;
+    if (allocated_ > allowance_) {
+        return cborError("decoded size would pass " + std::to_string(allowance_) + " bytes, " +
+                         std::to_string(kMaxDecodedBytesPerByte) + " times the payload's");
+    }
+    return std::nullopt;
+}
+
 MaybeError StreamDecoder::checkDepth() const {
     if (frames_.size() + 1 > kMaxNestingDepth) {
         return cborError("nesting deeper than " + std::to_string(kMaxNestingDepth) + " levels");
@@ -438,12 +488,16 @@ MaybeError StreamDecoder::openContainer(FrameKind kind, std::uint64_t count, std
     if (count == 0) {
         return kind == FrameKind::map ? deliver(Value(Dictionary())) : deliver(Value(Array()));
     }
+    // The whole container is charged before anything is allocated for it;
+    // once within the allowance, its count is safe to reserve at once.
+    if (auto error = charge(kind == FrameKind::map ? mapCost(count) : arrayCost(count))) {
+        return error;
+    }
     Frame& frame = frames_.emplace_back(Frame{kind, count, {}, {}, false});
-    std::size_t reserved = std::min<std::size_t>(count, kMaxReservedItems);
     if (kind == FrameKind::map) {
-        frame.entries.reserve(reserved);
+        frame.entries.reserve(count);
     } else {
-        frame.items.reserve(reserved);
+        frame.items.reserve(count);
     }
     return std::nullopt;
 }
@@ -458,6 +512,11 @@ MaybeError StreamDecoder::openTag(std::uint64_t tag) {
     }
     if (auto error = checkDepth()) {
         return error;
+    }
+    if (kind == FrameKind::packedTag) {
+        if (auto error = charge(kPackedCost)) {
+            return error;
+        }
     }
     frames_.push_back(Frame{kind, 0, {}, {}, false});
     return std::nullopt;
@@ -738,6 +797,15 @@ private:
 
 Result<Value> decode(std::span<const std::uint8_t> payload) {
     return StreamDecoder(payload).run();
+}
+
+Result<Decoded> decodeMeasured(std::span<const std::uint8_t> payload) {
+    StreamDecoder decoder(payload);
+    auto value = decoder.run();
+    if (!value) {
+        return std::move(value).error();
+    }
+    return Decoded{std::move(value).value(), decoder.allocatedBytes()};
 }
 
 void encode(const Value& value, Bytes& out) {

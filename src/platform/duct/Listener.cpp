@@ -40,9 +40,12 @@ std::string boundPath(int fd) {
 }  // namespace
 
 Result<std::shared_ptr<Listener>> Listener::create(EventLoop& loop, const std::string& serviceName,
-                                                   SerialQueue& eventQueue) {
+                                                   SerialQueue& eventQueue, std::shared_ptr<ReceiveBudget> budget) {
     if (auto path = serviceSocketPath(serviceName); !path) {
         return path.error();
+    }
+    if (!budget) {
+        budget = std::make_shared<ReceiveBudget>(loop);
     }
     auto activated = takeSocketActivationDescriptors();
     if (!activated.empty()) {
@@ -64,21 +67,22 @@ Result<std::shared_ptr<Listener>> Listener::create(EventLoop& loop, const std::s
         ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK);
         ::fcntl(socket.get(), F_SETFD, FD_CLOEXEC);
         std::string path = boundPath(socket.get());
-        return std::shared_ptr<Listener>(
-            new Listener(loop, serviceName, eventQueue, std::move(socket), UniqueFd(), std::move(path), false));
+        return std::shared_ptr<Listener>(new Listener(loop, serviceName, eventQueue, std::move(socket), UniqueFd(),
+                                                      std::move(path), false, std::move(budget)));
     }
     auto claimed = openServiceSocket(serviceName);
     if (!claimed) {
         return claimed.error();
     }
     return std::shared_ptr<Listener>(new Listener(loop, serviceName, eventQueue, std::move(claimed->listener),
-                                                  std::move(claimed->lock), std::move(claimed->path), true));
+                                                  std::move(claimed->lock), std::move(claimed->path), true,
+                                                  std::move(budget)));
 }
 
 Listener::Listener(EventLoop& loop, std::string serviceName, SerialQueue& eventQueue, UniqueFd socket, UniqueFd lock,
-                   std::string socketPath, bool boundHere)
+                   std::string socketPath, bool boundHere, std::shared_ptr<ReceiveBudget> budget)
     : loop_(loop), serviceName_(std::move(serviceName)), eventQueue_(eventQueue), socket_(std::move(socket)),
-      lock_(std::move(lock)), socketPath_(std::move(socketPath)), boundHere_(boundHere) {}
+      lock_(std::move(lock)), socketPath_(std::move(socketPath)), boundHere_(boundHere), budget_(std::move(budget)) {}
 
 Listener::~Listener() = default;
 
@@ -115,8 +119,10 @@ void Listener::acceptPending() {
             }
             return;  // EAGAIN, or a peer that gave up before we took it
         }
+        // Right after accept, before the peer can exit and its pid be reused.
+        auto identity = capturePeerIdentity(peer.get());
         std::weak_ptr<Listener> weakSelf = weak_from_this();
-        auto connection = PeerConnection::adopt(loop_, std::move(peer), [weakSelf] {
+        auto connection = PeerConnection::adopt(loop_, std::move(peer), std::move(identity), budget_, [weakSelf] {
             if (auto self = weakSelf.lock()) {
                 self->resumeAccepting();
             }
@@ -134,7 +140,9 @@ void Listener::pauseAccepting() {
         return;
     }
     paused_ = true;
-    (void)loop_.modify(registration_, socket_.get(), 0);
+    if (auto error = loop_.modify(registration_, socket_.get(), 0)) {
+        systemLogf(kLogNotice, "cannot pause accepting connections: %@", error->text());
+    }
     // Retry after a while even if no connection closes (another process may free descriptors).
     loop_.postAfter(std::chrono::seconds(1), [weakSelf = weak_from_this()] {
         if (auto self = weakSelf.lock()) {
@@ -147,8 +155,17 @@ void Listener::resumeAccepting() {
     if (!paused_ || !registered_) {
         return;
     }
+    if (auto error = loop_.modify(registration_, socket_.get(), EPOLLIN)) {
+        // Still paused: the next closed connection, or this retry, tries again.
+        systemLogf(kLogNotice, "cannot resume accepting connections, retrying in a second: %@", error->text());
+        loop_.postAfter(std::chrono::seconds(1), [weakSelf = weak_from_this()] {
+            if (auto self = weakSelf.lock()) {
+                self->resumeAccepting();
+            }
+        });
+        return;
+    }
     paused_ = false;
-    (void)loop_.modify(registration_, socket_.get(), EPOLLIN);
 }
 
 void Listener::stop() {

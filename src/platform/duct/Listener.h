@@ -6,6 +6,10 @@
 //
 // Running out of descriptors never spins: accepting pauses until a
 // connection closes, or a second has passed.
+//
+// Each peer's identity is fixed right after accept, and all its connections
+// draw on one ReceiveBudget: the daemon has one listener, so that budget is
+// the process's.
 
 #include <functional>
 #include <memory>
@@ -24,9 +28,10 @@ public:
     using ConnectionHandler = std::function<void(std::shared_ptr<PeerConnection>)>;
 
     // Listens on the service's socket; with systemd socket activation, on the
-    // passed socket instead.
+    // passed socket instead. Without a budget, one with the default limits.
     static Result<std::shared_ptr<Listener>> create(EventLoop& loop, const std::string& serviceName,
-                                                    SerialQueue& eventQueue);
+                                                    SerialQueue& eventQueue,
+                                                    std::shared_ptr<ReceiveBudget> budget = nullptr);
     ~Listener() override;
 
     void setConnectionHandler(ConnectionHandler handler);  // before resume()
@@ -40,12 +45,13 @@ public:
     // Removes the socket file, only when this process bound it: a socket
     // passed by the service manager stays for the next activation.
     void unlinkOwnSocket();
+    const std::shared_ptr<ReceiveBudget>& budget() const noexcept { return budget_; }
 
     void handleEvents(std::uint32_t events) override;
 
 private:
     Listener(EventLoop& loop, std::string serviceName, SerialQueue& eventQueue, UniqueFd socket, UniqueFd lock,
-             std::string socketPath, bool boundHere);
+             std::string socketPath, bool boundHere, std::shared_ptr<ReceiveBudget> budget);
     void acceptPending();
     void pauseAccepting();
     void resumeAccepting();
@@ -57,6 +63,7 @@ private:
     UniqueFd lock_;
     const std::string socketPath_;
     const bool boundHere_;
+    const std::shared_ptr<ReceiveBudget> budget_;
     ConnectionHandler handler_;
     EventLoop::RegistrationId registration_ = 0;
     bool registered_ = false;

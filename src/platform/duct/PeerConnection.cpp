@@ -2,93 +2,105 @@
 
 #include <sys/socket.h>
 
+#include <algorithm>
+#include <cassert>
 #include <cerrno>
-#include <cstring>
 
 #include "platform/duct/CborCodec.h"
 #include "platform/duct/Frame.h"
-#include "platform/process/ProcessInfo.h"
 #include "platform/text/Format.h"
 
 namespace qm::duct {
 
 namespace {
 
-// Debian 12's headers lack it; kernels from 6.5 answer it.
-constexpr int kSoPeerPidfd = 77;
-
-constexpr std::size_t kInitialReadBuffer = 64 * 1024;
 constexpr std::size_t kMaxReadPerTurn = 256 * 1024;  // then other connections get their turn
+// Storage an idle connection keeps; what a bigger frame took is given back.
+constexpr std::size_t kKeptBufferCapacity = 64 * 1024;
+constexpr std::size_t kMaxFrameSize = kFrameHeaderSize + kMaxPayloadSize;
 
-UniqueFd peerPidfd(int socket, pid_t pid) {
-    int pidfd = -1;
-    socklen_t length = sizeof pidfd;
-    if (::getsockopt(socket, SOL_SOCKET, kSoPeerPidfd, &pidfd, &length) == 0 && pidfd >= 0) {
-        return UniqueFd(pidfd);
+ucred socketCredentials(int socket) {
+    ucred credentials{};
+    socklen_t length = sizeof credentials;
+    if (::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0) {
+        return ucred{};
     }
-    return openPidfd(pid);
+    return credentials;
 }
 
 }  // namespace
 
 // ---- IncomingMessage
 
-IncomingMessage::IncomingMessage(std::weak_ptr<PeerConnection> connection, std::uint64_t id, Value body)
-    : connection_(std::move(connection)), id_(id), body_(std::move(body)) {}
+IncomingMessage::IncomingMessage(std::weak_ptr<PeerConnection> connection, std::uint64_t id, Value body,
+                                 std::shared_ptr<ReceiveBudget> budget, std::size_t decodedBytes)
+    : connection_(std::move(connection)), id_(id), body_(std::move(body)), budget_(std::move(budget)),
+      decodedBytes_(decodedBytes) {}
 
 IncomingMessage::IncomingMessage(IncomingMessage&& other) noexcept
     : connection_(std::move(other.connection_)), id_(other.id_), body_(std::move(other.body_)),
+      budget_(std::move(other.budget_)), decodedBytes_(std::exchange(other.decodedBytes_, 0)),
       answered_(std::exchange(other.answered_, true)) {}
 
 IncomingMessage::~IncomingMessage() {
-    if (answered_) {
-        return;
-    }
-    if (auto connection = connection_.lock()) {
-        connection->releaseRequestSlot();
+    if (!answered_) {
+        finish();
     }
 }
 
-bool IncomingMessage::reply(const Value& reply) {
-    if (answered_) {
-        return false;
-    }
-    answered_ = true;
+ReplyResult IncomingMessage::reply(const Value& reply) {
+    assert(!answered_ && "a message is answered once");
     auto connection = connection_.lock();
-    return connection && connection->sendReply(id_, reply);
+    if (!connection || !connection->isValid()) {
+        finish();
+        return ReplyResult::connectionGone;
+    }
+    auto frame = encodeFrame(FrameKind::reply, id_, reply);
+    if (!frame) {
+        return ReplyResult::tooLarge;  // still unanswered: the caller may send a smaller reply
+    }
+    ReplyResult result = connection->sendFrame(std::move(*frame));
+    finish();
+    return result;
+}
+
+void IncomingMessage::finish() {
+    answered_ = true;
+    if (auto connection = connection_.lock()) {
+        connection->releaseRequestSlot();
+    }
+    if (budget_) {
+        budget_->releaseDecoded(std::exchange(decodedBytes_, 0));
+    }
 }
 
 // ---- PeerConnection
 
 std::shared_ptr<PeerConnection> PeerConnection::adopt(EventLoop& loop, UniqueFd socket,
+                                                      std::optional<PeerIdentity> identity,
+                                                      std::shared_ptr<ReceiveBudget> budget,
                                                       std::function<void()> onClosed) {
-    return std::shared_ptr<PeerConnection>(new PeerConnection(loop, std::move(socket), std::move(onClosed)));
+    assert(budget);
+    return std::shared_ptr<PeerConnection>(
+        new PeerConnection(loop, std::move(socket), std::move(identity), std::move(budget), std::move(onClosed)));
 }
 
-PeerConnection::PeerConnection(EventLoop& loop, UniqueFd socket, std::function<void()> onClosed)
-    : loop_(loop), socket_(std::move(socket)), onClosed_(std::move(onClosed)) {
-    ucred cred{};
-    socklen_t length = sizeof cred;
-    if (::getsockopt(socket_.get(), SOL_SOCKET, SO_PEERCRED, &cred, &length) == 0) {
-        credentials_ = PeerCredentials{cred.pid, cred.uid, cred.gid};
+PeerConnection::PeerConnection(EventLoop& loop, UniqueFd socket, std::optional<PeerIdentity> identity,
+                               std::shared_ptr<ReceiveBudget> budget, std::function<void()> onClosed)
+    : loop_(loop), socket_(std::move(socket)), identity_(std::move(identity)),
+      pid_(identity_ ? identity_->pid : socketCredentials(socket_.get()).pid),
+      uid_(identity_ ? identity_->uid : socketCredentials(socket_.get()).uid), budget_(std::move(budget)),
+      onClosed_(std::move(onClosed)) {}
+
+PeerConnection::~PeerConnection() {
+    // Closed connections hold nothing; this is for one its stopped loop dropped unclosed.
+    if (!buffer_.empty()) {
+        budget_->forget(*this, buffer_.size());
     }
-    pidfd_ = peerPidfd(socket_.get(), credentials_.pid);
-}
-
-PeerConnection::~PeerConnection() = default;
-
-pid_t PeerConnection::pid() const noexcept {
-    return credentials_.pid;
 }
 
 std::optional<std::string> PeerConnection::peerExecutablePath() const {
-    auto path = executablePathOfProcess(credentials_.pid);
-    // Read the path first, then check that the process we accepted still
-    // lives: otherwise the pid may already name somebody else.
-    if (!path || (pidfd_.valid() && !pidfdProcessAlive(pidfd_.get()))) {
-        return std::nullopt;
-    }
-    return path;
+    return identity_ ? identity_->executablePath : std::nullopt;
 }
 
 void PeerConnection::setEventHandler(EventHandler handler) {
@@ -104,19 +116,23 @@ void PeerConnection::resume() {
     if (closed_.load() || registered_) {
         return;
     }
-    readBuffer_.resize(kInitialReadBuffer);
-    auto id = loop_.add(socket_.get(), EPOLLIN | EPOLLRDHUP, shared_from_this());
-    if (!id) {
-        ::shutdown(socket_.get(), SHUT_RDWR);
-        loop_.post([weak = weak_from_this(), reason = id.error().text()] {
-            if (auto self = weak.lock()) {
-                self->closeNow(reason);
-            }
-        });
+    std::string failure;
+    if (!identity_) {
+        // Its frames, already buffered or not, are never read.
+        failure = "peer hung up before its identity could be fixed";
+    } else if (auto id = loop_.add(socket_.get(), EPOLLIN | EPOLLRDHUP, shared_from_this())) {
+        registration_ = *id;
+        registered_ = true;
         return;
+    } else {
+        failure = id.error().text();
     }
-    registration_ = *id;
-    registered_ = true;
+    ::shutdown(socket_.get(), SHUT_RDWR);
+    loop_.post([weak = weak_from_this(), failure] {
+        if (auto self = weak.lock()) {
+            self->closeNow(failure);
+        }
+    });
 }
 
 void PeerConnection::invalidate(const std::string& reason) {
@@ -132,8 +148,7 @@ void PeerConnection::invalidate(const std::string& reason) {
 }
 
 std::string PeerConnection::description() const {
-    return format("<connection pid=%d uid=%u%s>", credentials_.pid, credentials_.uid,
-                  closed_.load() ? " closed" : "");
+    return format("<connection pid=%d uid=%u%s>", pid_, uid_, closed_.load() ? " closed" : "");
 }
 
 void PeerConnection::handleEvents(std::uint32_t events) {
@@ -144,10 +159,10 @@ void PeerConnection::handleEvents(std::uint32_t events) {
         flushBacklog();
     }
     bool hungUp = (events & (EPOLLHUP | EPOLLERR)) != 0;
-    if (events & (EPOLLIN | EPOLLRDHUP | EPOLLHUP)) {
-        readAvailable(hungUp);
+    // While it waits, only a hang-up or room in the backlog brings it here.
+    if ((events & (EPOLLIN | EPOLLRDHUP | EPOLLHUP)) && waitingFor_.load() == Wait::none) {
+        waitFor(receive(hungUp));
     }
-    deliverFrames();
     if (closed_.load()) {
         return;
     }
@@ -161,133 +176,172 @@ void PeerConnection::handleEvents(std::uint32_t events) {
     }
 }
 
-void PeerConnection::readAvailable(bool& hungUp) {
-    {
-        std::lock_guard lock(writeMutex_);
-        if (readingPaused_) {
-            return;
-        }
-    }
+// Delivers what is complete and reads what the budget allows, until the
+// socket is drained, this turn's share is read, or the connection must wait.
+PeerConnection::Wait PeerConnection::receive(bool& hungUp) {
     std::size_t readThisTurn = 0;
-    while (readThisTurn < kMaxReadPerTurn) {
-        if (readStart_ == readEnd_) {
-            readStart_ = readEnd_ = 0;
+    while (true) {
+        Wait wait = deliverFrames();
+        if (closed_.load() || wait != Wait::none || readThisTurn >= kMaxReadPerTurn) {
+            return wait;
         }
-        if (readEnd_ == readBuffer_.size()) {
-            if (readStart_ > 0) {
-                std::memmove(readBuffer_.data(), readBuffer_.data() + readStart_, readEnd_ - readStart_);
-                readEnd_ -= readStart_;
-                readStart_ = 0;
-            } else {
-                break;  // full of one partial frame: deliverFrames() grows it to the frame's size
-            }
+        std::size_t allowance = budget_->receiveAllowance(buffer_.size());
+        if (allowance == 0) {
+            return Wait::partialBudget;
         }
-        ssize_t n = ::recv(socket_.get(), readBuffer_.data() + readEnd_, readBuffer_.size() - readEnd_, MSG_DONTWAIT);
+        auto room = buffer_.room(bufferCeiling());
+        assert(!room.empty() && "a complete frame is delivered or waited for before reading on");
+        bufferCapacity_.store(buffer_.capacity());
+        std::size_t wanted = std::min({room.size(), allowance, kMaxReadPerTurn - readThisTurn});
+        ssize_t n = ::recv(socket_.get(), room.data(), wanted, MSG_DONTWAIT);
         if (n > 0) {
-            std::size_t room = readBuffer_.size() - readEnd_;
-            readEnd_ += static_cast<std::size_t>(n);
-            readThisTurn += static_cast<std::size_t>(n);
-            if (static_cast<std::size_t>(n) < room) {
-                break;  // drained for now; level-triggered epoll calls again if more comes
+            auto count = static_cast<std::size_t>(n);
+            buffer_.commit(count);
+            budget_->chargePartial(shared_from_this(), count);
+            bufferedBytes_.store(buffer_.size());
+            readThisTurn += count;
+            if (count < wanted) {
+                return deliverFrames();  // drained for now; level-triggered epoll calls again if more comes
             }
             continue;
         }
-        if (n == 0) {
-            hungUp = true;
-        } else if (errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR) {
+        if (n == 0 || (errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR)) {
             hungUp = true;
         }
-        break;
+        return Wait::none;
     }
 }
 
-void PeerConnection::deliverFrames() {
+// Per connection: at most one maximal frame of received bytes. The storage
+// grows only up to the frame being received, and only as its bytes arrive.
+std::size_t PeerConnection::bufferCeiling() const {
+    if (buffer_.size() < kFrameHeaderSize) {
+        return ReceiveBuffer::kInitialCapacity;
+    }
+    std::size_t frameSize = kFrameHeaderSize + readFrameHeader(buffer_.data()).payloadLength;
+    assert(frameSize <= kMaxFrameSize && "headers are checked before their payload is read");
+    return std::min(frameSize, kMaxFrameSize);
+}
+
+PeerConnection::Wait PeerConnection::deliverFrames() {
     while (!closed_.load()) {
-        std::size_t available = readEnd_ - readStart_;
-        if (available < kFrameHeaderSize) {
-            break;
+        if (buffer_.size() < kFrameHeaderSize) {
+            return Wait::none;
         }
-        FrameHeader header = readFrameHeader(readBuffer_.data() + readStart_);
+        FrameHeader header = readFrameHeader(buffer_.data());
         if (header.payloadLength > kMaxPayloadSize) {
             closeNow(format("frame announces %u bytes, over the 16 MiB limit", header.payloadLength));
-            return;
+            return Wait::none;
         }
         if (header.kind != static_cast<std::uint32_t>(FrameKind::message)) {
             closeNow(format("frame of kind %u from a client", header.kind));
-            return;
+            return Wait::none;
         }
         std::size_t frameSize = kFrameHeaderSize + header.payloadLength;
-        if (available < frameSize) {
-            if (readBuffer_.size() - readStart_ < frameSize) {
-                std::memmove(readBuffer_.data(), readBuffer_.data() + readStart_, available);
-                readStart_ = 0;
-                readEnd_ = available;
-                if (readBuffer_.size() < frameSize) {
-                    readBuffer_.resize(frameSize);
-                }
-            }
-            break;
+        if (buffer_.size() < frameSize) {
+            return Wait::none;
         }
-        if (unanswered_.load() >= kMaxUnansweredRequests) {
-            std::lock_guard lock(writeMutex_);
-            readingPaused_ = true;
-            updateInterestLocked();
-            break;
+        int inFlight = unanswered_.load();
+        if (inFlight >= kMaxUnansweredRequests) {
+            return Wait::unanswered;
         }
-        auto decoded = cbor::decode({readBuffer_.data() + readStart_ + kFrameHeaderSize, header.payloadLength});
+        if (!budget_->mayDecode(header.payloadLength, inFlight == 0)) {
+            return Wait::decodedBudget;
+        }
+        auto decoded = cbor::decodeMeasured({buffer_.data() + kFrameHeaderSize, header.payloadLength});
         if (!decoded) {
             closeNow("invalid payload: " + decoded.error().text());
-            return;
+            return Wait::none;
         }
-        readStart_ += frameSize;
+        consumeBuffered(frameSize, true);
+        budget_->chargeDecoded(decoded->allocatedBytes);
         unanswered_.fetch_add(1);
+        IncomingMessage message(weak_from_this(), header.messageId, std::move(decoded->value), budget_,
+                                decoded->allocatedBytes);
         if (handler_) {
-            handler_(ConnectionEvent{ConnectionEvent::Kind::message,
-                                     IncomingMessage(weak_from_this(), header.messageId, std::move(decoded).value()),
-                                     {}});
+            handler_(ConnectionEvent{ConnectionEvent::Kind::message, std::move(message), {}});
         }
     }
-    if (readStart_ == readEnd_) {
-        readStart_ = readEnd_ = 0;
-        if (readBuffer_.size() > 4 * kInitialReadBuffer) {
-            Bytes(kInitialReadBuffer).swap(readBuffer_);  // give back what a big frame took
+    return Wait::none;
+}
+
+void PeerConnection::consumeBuffered(std::size_t count, bool frameCompleted) {
+    buffer_.consume(count);
+    budget_->releasePartial(*this, count, buffer_.empty(), frameCompleted);
+    if (buffer_.empty() && buffer_.capacity() > kKeptBufferCapacity) {
+        buffer_.release();
+    }
+    bufferedBytes_.store(buffer_.size());
+    bufferCapacity_.store(buffer_.capacity());
+}
+
+void PeerConnection::waitFor(Wait wait) {
+    if (closed_.load()) {
+        return;
+    }
+    waitingFor_.store(wait);
+    {
+        std::lock_guard lock(writeMutex_);
+        if (readingPaused_ != (wait != Wait::none)) {
+            readingPaused_ = wait != Wait::none;
+            updateInterestLocked();
         }
+    }
+    switch (wait) {
+        case Wait::none: return;
+        case Wait::unanswered:
+            // An answer between the check and now found nobody waiting.
+            if (unanswered_.load() < kMaxUnansweredRequests) {
+                postResumeAfterAnswer();
+            }
+            return;
+        case Wait::partialBudget: budget_->wait(ReceiveBudget::Pool::partial, shared_from_this()); return;
+        case Wait::decodedBudget: budget_->wait(ReceiveBudget::Pool::decoded, shared_from_this()); return;
     }
 }
 
-bool PeerConnection::sendReply(std::uint64_t id, const Value& reply) {
-    auto frame = encodeFrame(FrameKind::reply, id, reply);
-    bool sent = false;
-    {
-        std::lock_guard lock(writeMutex_);
-        if (!frame) {
-            if (!closed_.load()) {
-                pendingInvalidReason_ = "reply over the 16 MiB limit";
-                ::shutdown(socket_.get(), SHUT_RDWR);
-            }
-        } else if (!closed_.load()) {
-            sent = true;
-            if (backlog_.empty()) {
-                ssize_t n = ::send(socket_.get(), frame->data(), frame->size(), MSG_DONTWAIT | MSG_NOSIGNAL);
-                if (n < 0 && errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR) {
-                    ::shutdown(socket_.get(), SHUT_RDWR);  // the peer is gone; the loop reports it
-                } else if (n < 0 || static_cast<std::size_t>(n) < frame->size()) {
-                    frontWritten_ = n < 0 ? 0 : static_cast<std::size_t>(n);
-                    backlog_.push_back(std::move(*frame));
-                    updateInterestLocked();
-                }
-            } else if (backlogBytes_ + frame->size() > kMaxReplyBacklog) {
-                pendingInvalidReason_ = "reply backlog over 4 MiB: the client does not read";
-                ::shutdown(socket_.get(), SHUT_RDWR);
-                sent = false;
-            } else {
-                backlogBytes_ += frame->size();
-                backlog_.push_back(std::move(*frame));
-            }
-        }
+void PeerConnection::resumeReceiving() {
+    if (closed_.load()) {
+        return;
     }
-    releaseRequestSlot();
-    return sent;
+    bool hungUp = false;
+    waitFor(receive(hungUp));
+    if (hungUp && !closed_.load()) {
+        std::string reason;
+        {
+            std::lock_guard lock(writeMutex_);
+            reason = pendingInvalidReason_.empty() ? "peer hung up" : pendingInvalidReason_;
+        }
+        closeNow(reason);
+    }
+}
+
+ReplyResult PeerConnection::sendFrame(Bytes frame) {
+    std::lock_guard lock(writeMutex_);
+    if (closed_.load()) {
+        return ReplyResult::connectionGone;
+    }
+    if (!backlog_.empty()) {
+        if (backlogBytes_ + frame.size() > kMaxReplyBacklog) {
+            pendingInvalidReason_ = "reply backlog over 4 MiB: the client does not read";
+            ::shutdown(socket_.get(), SHUT_RDWR);
+            return ReplyResult::connectionGone;
+        }
+        backlogBytes_ += frame.size();
+        backlog_.push_back(std::move(frame));
+        return ReplyResult::sent;
+    }
+    ssize_t n = ::send(socket_.get(), frame.data(), frame.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+    if (n < 0 && errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR) {
+        ::shutdown(socket_.get(), SHUT_RDWR);  // the peer is gone; the loop reports it
+        return ReplyResult::connectionGone;
+    }
+    if (n < 0 || static_cast<std::size_t>(n) < frame.size()) {
+        frontWritten_ = n < 0 ? 0 : static_cast<std::size_t>(n);
+        backlog_.push_back(std::move(frame));
+        updateInterestLocked();
+    }
+    return ReplyResult::sent;
 }
 
 void PeerConnection::flushBacklog() {
@@ -316,21 +370,19 @@ void PeerConnection::flushBacklog() {
 }
 
 void PeerConnection::releaseRequestSlot() {
-    if (unanswered_.fetch_sub(1) != kMaxUnansweredRequests) {
-        return;
+    // Sequentially consistent with waitFor(): either this sees the wait, or
+    // the waiter sees this answer.
+    if (unanswered_.fetch_sub(1) == kMaxUnansweredRequests && waitingFor_.load() == Wait::unanswered) {
+        postResumeAfterAnswer();
     }
+}
+
+void PeerConnection::postResumeAfterAnswer() {
     loop_.post([weak = weak_from_this()] {
         auto self = weak.lock();
-        if (!self || self->closed_.load()) {
-            return;
+        if (self && self->waitingFor_.load() == Wait::unanswered) {
+            self->resumeReceiving();
         }
-        self->deliverFrames();
-        if (self->closed_.load() || self->unanswered_.load() >= kMaxUnansweredRequests) {
-            return;
-        }
-        std::lock_guard lock(self->writeMutex_);
-        self->readingPaused_ = false;
-        self->updateInterestLocked();
     });
 }
 
@@ -338,14 +390,25 @@ void PeerConnection::updateInterestLocked() {
     if (!registered_ || closed_.load()) {
         return;
     }
-    std::uint32_t events = EPOLLRDHUP;
+    std::uint32_t events = EPOLLRDHUP;  // always: hang-ups are seen even while reading waits
     if (!readingPaused_) {
         events |= EPOLLIN;
     }
     if (!backlog_.empty()) {
         events |= EPOLLOUT;
     }
-    (void)loop_.modify(registration_, socket_.get(), events);
+    if (auto error = loop_.modify(registration_, socket_.get(), events)) {
+        // Without the events it asked for, the connection could wait forever.
+        if (pendingInvalidReason_.empty()) {
+            pendingInvalidReason_ = "cannot change the connection's events: " + error->text();
+        }
+        ::shutdown(socket_.get(), SHUT_RDWR);
+        loop_.post([weak = weak_from_this(), reason = pendingInvalidReason_] {
+            if (auto self = weak.lock()) {
+                self->closeNow(reason);
+            }
+        });
+    }
 }
 
 void PeerConnection::closeNow(const std::string& reason) {
@@ -367,8 +430,11 @@ void PeerConnection::closeNow(const std::string& reason) {
         handler(ConnectionEvent{ConnectionEvent::Kind::invalid, std::nullopt, reason});
     }
     context_.reset();
-    Bytes().swap(readBuffer_);
-    readStart_ = readEnd_ = 0;
+    if (!buffer_.empty()) {
+        consumeBuffered(buffer_.size(), false);
+    }
+    buffer_.release();
+    bufferCapacity_.store(0);
     if (onClosed_) {
         onClosed_();
     }

@@ -8,13 +8,18 @@
 // counting the reply being written) makes the connection invalid, so a peer
 // that never reads cannot make the daemon hold unbounded memory.
 //
-// Fairness: at most 64 requests of a connection are read but not answered;
-// past that the connection is not read until replies go out, so one client
-// never floods the daemon's queue ahead of the others.
+// Memory follows the bytes received: a frame's buffer grows as its bytes
+// arrive, and the connection draws on the process's ReceiveBudget for what it
+// holds undecoded and for the requests it has in flight. Fairness: at most 64
+// requests of a connection are read but not answered. Past any of these the
+// connection is not read until there is room again (hang-ups are still
+// seen), so one client never floods the daemon ahead of the others.
 //
 // Anything that breaks the framing or the payload rules makes the connection
 // invalid at once; the event handler then sees one `invalid` event, after
-// which it is released together with the connection's context.
+// which it is released together with the connection's context. A connection
+// whose peer identity could not be fixed at accept delivers nothing but that
+// `invalid` event.
 
 #include <sys/types.h>
 
@@ -28,6 +33,9 @@
 #include <string>
 
 #include "platform/duct/OpenTransaction.h"
+#include "platform/duct/PeerIdentity.h"
+#include "platform/duct/ReceiveBudget.h"
+#include "platform/duct/ReceiveBuffer.h"
 #include "platform/fd/UniqueFd.h"
 #include "platform/queue/EventLoop.h"
 #include "platform/value/Value.h"
@@ -39,11 +47,19 @@ inline constexpr std::size_t kMaxReplyBacklog = 4u * 1024 * 1024;
 
 class PeerConnection;
 
-// One request read from a peer, with the means to answer it once. Dropping it
-// unanswered frees the request's place in the connection's quota.
+enum class ReplyResult {
+    sent,            // written or queued for the peer
+    connectionGone,  // the connection is closed (or closed because of this reply); nothing will reach the peer
+    tooLarge,        // the encoding passes kMaxPayloadSize: nothing was sent, the message is still unanswered
+};
+
+// One request read from a peer, with the means to answer it once. Answering
+// it, or dropping it unanswered, frees its place in the connection's quota
+// and its decoded bytes in the budget.
 class IncomingMessage {
 public:
-    IncomingMessage(std::weak_ptr<PeerConnection> connection, std::uint64_t id, Value body);
+    IncomingMessage(std::weak_ptr<PeerConnection> connection, std::uint64_t id, Value body,
+                    std::shared_ptr<ReceiveBudget> budget, std::size_t decodedBytes);
     ~IncomingMessage();
     IncomingMessage(IncomingMessage&& other) noexcept;
     IncomingMessage& operator=(IncomingMessage&&) = delete;
@@ -53,15 +69,21 @@ public:
     const Value& body() const noexcept { return body_; }
     std::uint64_t id() const noexcept { return id_; }
 
-    // Sends the reply from the calling thread without blocking. Only the first
-    // call sends; false when the connection no longer exists.
-    bool reply(const Value& reply);
+    // Sends the reply from the calling thread without blocking. `sent` and
+    // `connectionGone` answer the message; after `tooLarge` it is still
+    // unanswered and a smaller reply (an error) may follow. Answering twice is
+    // a programming error.
+    ReplyResult reply(const Value& reply);
     bool replied() const noexcept { return answered_; }
 
 private:
+    void finish();
+
     std::weak_ptr<PeerConnection> connection_;
     std::uint64_t id_;
     Value body_;
+    std::shared_ptr<ReceiveBudget> budget_;
+    std::size_t decodedBytes_;
     bool answered_ = false;
 };
 
@@ -72,25 +94,27 @@ struct ConnectionEvent {
     std::string reason;                      // for `invalid`
 };
 
-struct PeerCredentials {
-    pid_t pid = 0;
-    uid_t uid = 0;
-    gid_t gid = 0;
-};
-
-class PeerConnection final : public EventSource, public std::enable_shared_from_this<PeerConnection> {
+class PeerConnection final : public EventSource,
+                             public ReceiveBudget::Member,
+                             public std::enable_shared_from_this<PeerConnection> {
 public:
     using EventHandler = std::function<void(ConnectionEvent&&)>;
 
-    // Takes an accepted socket; reads the peer's credentials and pidfd now, so
-    // a recycled pid can never inherit this peer's identity.
+    // Takes an accepted socket and the identity captured right after accept
+    // (capturePeerIdentity); without one, the connection never delivers a
+    // message. The budget is the process's (the listener's).
     static std::shared_ptr<PeerConnection> adopt(EventLoop& loop, UniqueFd socket,
+                                                 std::optional<PeerIdentity> identity,
+                                                 std::shared_ptr<ReceiveBudget> budget,
                                                  std::function<void()> onClosed);
     ~PeerConnection() override;
 
-    const PeerCredentials& credentials() const noexcept { return credentials_; }
-    pid_t pid() const noexcept;
-    // The peer's executable, verified against the pidfd taken at accept time.
+    // Fixed at accept, for the connection's whole life.
+    const std::optional<PeerIdentity>& identity() const noexcept { return identity_; }
+    // The pid the socket named at accept (the identity's when there is one),
+    // kept after the connection closes.
+    pid_t pid() const noexcept { return pid_; }
+    // The identity's executable path.
     std::optional<std::string> peerExecutablePath() const;
 
     // Set before resume(). The context is kept until the connection closes.
@@ -103,26 +127,49 @@ public:
     void invalidate(const std::string& reason);
     bool isValid() const noexcept { return !closed_.load(); }
 
-    std::string description() const;
+    // What the connection holds of frames not decoded yet, and the storage
+    // that takes (diagnostics and tests; any thread).
+    std::size_t bufferedBytes() const noexcept { return bufferedBytes_.load(); }
+    std::size_t bufferCapacity() const noexcept { return bufferCapacity_.load(); }
+
+    std::string description() const override;
 
     void handleEvents(std::uint32_t events) override;
 
 private:
     friend class IncomingMessage;
 
-    PeerConnection(EventLoop& loop, UniqueFd socket, std::function<void()> onClosed);
-    bool sendReply(std::uint64_t id, const Value& reply);
+    // Why reading stopped; each has its own way back.
+    enum class Wait : std::uint8_t {
+        none,
+        unanswered,     // 64 requests in flight: the next answer resumes it
+        partialBudget,  // the budget's queues resume these
+        decodedBudget,
+    };
+
+    PeerConnection(EventLoop& loop, UniqueFd socket, std::optional<PeerIdentity> identity,
+                   std::shared_ptr<ReceiveBudget> budget, std::function<void()> onClosed);
+    ReplyResult sendFrame(Bytes frame);
     void releaseRequestSlot();
-    void readAvailable(bool& hungUp);
-    void deliverFrames();
+    void postResumeAfterAnswer();
+    Wait receive(bool& hungUp);
+    Wait deliverFrames();
+    std::size_t bufferCeiling() const;
+    void consumeBuffered(std::size_t count, bool frameCompleted);
+    void waitFor(Wait wait);
+    void resumeReceiving() override;
+    std::size_t unfinishedBytes() const override { return buffer_.size(); }
+    void dropStalled(const std::string& reason) override { closeNow(reason); }
     void flushBacklog();
     void updateInterestLocked();
     void closeNow(const std::string& reason);
 
     EventLoop& loop_;
     UniqueFd socket_;
-    UniqueFd pidfd_;
-    PeerCredentials credentials_;
+    const std::optional<PeerIdentity> identity_;
+    const pid_t pid_;
+    const uid_t uid_;
+    const std::shared_ptr<ReceiveBudget> budget_;
     std::function<void()> onClosed_;
     EventLoop::RegistrationId registration_ = 0;
     OpenTransaction openTransaction_;
@@ -130,11 +177,11 @@ private:
     // Loop thread only.
     EventHandler handler_;
     std::shared_ptr<void> context_;
-    Bytes readBuffer_;
-    std::size_t readStart_ = 0;
-    std::size_t readEnd_ = 0;
-    std::string invalidReason_;
+    ReceiveBuffer buffer_;
 
+    std::atomic<std::size_t> bufferedBytes_{0};
+    std::atomic<std::size_t> bufferCapacity_{0};
+    std::atomic<Wait> waitingFor_{Wait::none};  // written on the loop thread
     std::atomic<int> unanswered_{0};
     std::atomic<bool> closed_{false};
 

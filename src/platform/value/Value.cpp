@@ -82,10 +82,31 @@ const char* valueTypeName(ValueType type) {
     return "unknown";
 }
 
-Value::Value(std::string s) : storage_(std::make_shared<const std::string>(std::move(s))) {}
-Value::Value(Bytes data) : storage_(std::make_shared<const Bytes>(std::move(data))) {}
-Value::Value(Array array) : storage_(std::make_shared<const Array>(std::move(array))) {}
-Value::Value(Dictionary dictionary) : storage_(std::make_shared<const Dictionary>(std::move(dictionary))) {}
+namespace {
+
+// Every empty string, data, array and dictionary shares one object, so a tree
+// of empty values costs its slots and nothing more. Never destroyed: values in
+// other static objects may outlive any order of destruction.
+template <class T>
+const std::shared_ptr<const T>& sharedEmpty() {
+    static const auto* empty = new std::shared_ptr<const T>(std::make_shared<const T>());
+    return *empty;
+}
+
+template <class T>
+std::shared_ptr<const T> shared(T&& content) {
+    if (content.empty()) {
+        return sharedEmpty<T>();
+    }
+    return std::make_shared<const T>(std::move(content));
+}
+
+}  // namespace
+
+Value::Value(std::string s) : storage_(shared(std::move(s))) {}
+Value::Value(Bytes data) : storage_(shared(std::move(data))) {}
+Value::Value(Array array) : storage_(shared(std::move(array))) {}
+Value::Value(Dictionary dictionary) : storage_(shared(std::move(dictionary))) {}
 
 Value Value::packed(Value propertyList) {
     Value value;

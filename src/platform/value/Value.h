@@ -5,8 +5,9 @@
 // A Value is immutable and cheap to copy: scalars are stored inline, strings,
 // data, arrays and dictionaries behind a shared pointer. "Changing" a
 // dictionary or array makes a new one whose untouched entries are shared with
-// the old one; nothing is ever deep-copied. Values may be handed between
-// threads freely.
+// the old one; nothing is ever deep-copied. Empty strings, data, arrays and
+// dictionaries all share one object per type, so they allocate nothing. Values
+// may be handed between threads freely.
 
 #include <cstdint>
 #include <memory>
