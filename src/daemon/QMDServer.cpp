@@ -103,7 +103,8 @@ void QMDServer::exitInOrder(std::string line) {
     service_->stop();
     auto deadline = std::chrono::steady_clock::now() + kExitFlushLimit;
     loop_->setTicker(std::chrono::milliseconds(10), [this, deadline, line = std::move(line)] {
-        if (mainQueue_->busy() && std::chrono::steady_clock::now() < deadline) {
+        bool flushing = mainQueue_->busy() || qm::duct::PeerConnection::connectionsWithUnsentReplies() != 0;
+        if (flushing && std::chrono::steady_clock::now() < deadline) {
             return;
         }
         service_->unlinkOwnSocket();

@@ -85,9 +85,10 @@ private:
     void resumeListener();
     void startIdleExitWatch(unsigned seconds);
     // Loop thread. Stops accepting, drops queued transactions, lets the
-    // running one write its reply (5 s at most), removes a socket it bound
-    // itself, logs `line` and _exit(0)s: static destructors never run while
-    // queue threads live, and holds vanish with the process.
+    // running one write its reply and the backlogs drain (5 s at most),
+    // removes a socket it bound itself, logs `line` and _exit(0)s: static
+    // destructors never run while queue threads live, and holds vanish with
+    // the process.
     void exitInOrder(std::string line);
 
     qm::Logger logger_;

@@ -339,9 +339,16 @@ ReplyResult PeerConnection::sendFrame(Bytes frame) {
     if (n < 0 || static_cast<std::size_t>(n) < frame.size()) {
         frontWritten_ = n < 0 ? 0 : static_cast<std::size_t>(n);
         backlog_.push_back(std::move(frame));
+        connectionsWithUnsentReplies_.fetch_add(1);
         updateInterestLocked();
     }
     return ReplyResult::sent;
+}
+
+std::atomic<std::size_t> PeerConnection::connectionsWithUnsentReplies_{0};
+
+std::size_t PeerConnection::connectionsWithUnsentReplies() noexcept {
+    return connectionsWithUnsentReplies_.load();
 }
 
 void PeerConnection::flushBacklog() {
@@ -364,6 +371,8 @@ void PeerConnection::flushBacklog() {
         frontWritten_ = 0;
         if (!backlog_.empty()) {
             backlogBytes_ -= backlog_.front().size();
+        } else {
+            connectionsWithUnsentReplies_.fetch_sub(1);
         }
     }
     updateInterestLocked();
@@ -422,7 +431,10 @@ void PeerConnection::closeNow(const std::string& reason) {
             registered_ = false;
         }
         socket_.reset();
-        backlog_.clear();
+        if (!backlog_.empty()) {
+            connectionsWithUnsentReplies_.fetch_sub(1);
+            backlog_.clear();
+        }
     }
     EventHandler handler = std::move(handler_);
     handler_ = nullptr;

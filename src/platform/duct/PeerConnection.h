@@ -134,6 +134,10 @@ public:
 
     std::string description() const override;
 
+    // Connections of this process whose replies wait, in part, in their
+    // backlog: an ending daemon flushes until none does.
+    static std::size_t connectionsWithUnsentReplies() noexcept;
+
     void handleEvents(std::uint32_t events) override;
 
 private:
@@ -188,6 +192,7 @@ private:
     // Guarded by writeMutex_: the socket for writing, the backlog, the interest set.
     mutable std::mutex writeMutex_;
     std::deque<Bytes> backlog_;
+    static std::atomic<std::size_t> connectionsWithUnsentReplies_;
     std::size_t frontWritten_ = 0;      // bytes of backlog_.front() already sent
     std::size_t backlogBytes_ = 0;      // bytes of backlog_ after the front frame
     bool readingPaused_ = false;
