@@ -67,13 +67,17 @@ void Transaction::dispatch() {
         return;  // the client is dead: no handler, no reply
     }
     server().debug("client %d request %s", client_->pid(), name ? name->c_str() : nullptr);
+    // The envelope's answers are made once: a malformed request costs no
+    // allocation for its message.
+    static const qm::Value kMissingType("invalid request format (missing type)");
+    static const qm::Value kUnrecognized("unrecognized request");
     if (name == nullptr) {
-        fail(kQMErrorInvalidRequest, std::string("invalid request format (missing type)"));
+        failWithMessage(kQMErrorInvalidRequest, kMissingType);
         return;
     }
     const Route* route = routeFor(*name);
     if (route == nullptr) {
-        fail(kQMErrorInvalidRequest, std::string("unrecognized request"));
+        failWithMessage(kQMErrorInvalidRequest, kUnrecognized);
         return;
     }
     RequestContext context{server().registry(), server().holds(), server().logger(), client_->identity(),
@@ -109,9 +113,17 @@ void Transaction::done() {
 }
 
 void Transaction::fail(int code, std::optional<std::string> message) {
+    reply_.reserve(reply_.size() + 2);
     reply_.set(wire::kErrorCode, static_cast<std::uint64_t>(static_cast<std::int64_t>(code)));
     if (message) {
         reply_.set(wire::kError, qm::Value(std::move(*message)));
     }
+    done();
+}
+
+void Transaction::failWithMessage(int code, const qm::Value& message) {
+    reply_.reserve(reply_.size() + 2);
+    reply_.set(wire::kErrorCode, static_cast<std::uint64_t>(static_cast<std::int64_t>(code)));
+    reply_.set(wire::kError, message);
     done();
 }

@@ -40,6 +40,8 @@ public:
 
 private:
     void finish(Reply reply);
+    // fail() with a message made once, shared by every reply that carries it.
+    void failWithMessage(int code, const qm::Value& message);
 
     qm::duct::IncomingMessage request_;
     std::shared_ptr<QMDDuctClient> client_;

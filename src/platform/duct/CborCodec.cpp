@@ -249,39 +249,61 @@ Result<Dictionary> dictionaryFromEntries(std::vector<Dictionary::Entry> entries)
     return std::move(*dictionary);
 }
 
+enum class FrameKind : std::uint8_t { array, map, dateTag, packedTag, uuidTag };
+
+struct Frame {
+    FrameKind kind;
+    std::size_t expected = 0;  // items of an array, pairs of a map
+    Array items;
+    // A map's key is placed with a null value until its value arrives.
+    std::vector<Dictionary::Entry> entries;
+    bool hasKey = false;
+};
+
+// A stretch of bytes that must hold exactly one item: the payload, or the
+// content of a tag 24. Its item is complete when the frame stack is back
+// to baseDepth.
+struct Segment {
+    const std::uint8_t* data;
+    std::size_t size;
+    std::size_t position;
+    std::size_t baseDepth;
+};
+
+// The decoder's two stacks, kept per thread so that a request costs no
+// allocation for them; emptied before and after every use.
+struct DecoderStacks {
+    std::vector<Segment> segments;
+    std::vector<Frame> frames;
+    bool inUse = false;
+};
+thread_local DecoderStacks threadStacks;
+
 // Decodes one payload head by head. Containers and tags under construction
 // sit on frames_; the content of each tag 24 is decoded as a nested segment of
 // the same payload, so neither nesting nor packed content recurses.
 class StreamDecoder {
 public:
     explicit StreamDecoder(std::span<const std::uint8_t> payload)
-        : payload_(payload), allowance_(decodedSizeBound(payload.size())) {}
+        : payload_(payload),
+          stacks_(threadStacks.inUse ? ownStacks_ : threadStacks),
+          segments_(stacks_.segments),
+          frames_(stacks_.frames),
+          allowance_(decodedSizeBound(payload.size())) {
+        stacks_.inUse = true;
+    }
+    ~StreamDecoder() {
+        segments_.clear();
+        frames_.clear();
+        stacks_.inUse = false;
+    }
+    StreamDecoder(const StreamDecoder&) = delete;
+    StreamDecoder& operator=(const StreamDecoder&) = delete;
 
     Result<Value> run();
     std::size_t allocatedBytes() const { return allocated_; }
 
 private:
-    enum class FrameKind : std::uint8_t { array, map, dateTag, packedTag, uuidTag };
-
-    struct Frame {
-        FrameKind kind;
-        std::size_t expected = 0;  // items of an array, pairs of a map
-        Array items;
-        // A map's key is placed with a null value until its value arrives.
-        std::vector<Dictionary::Entry> entries;
-        bool hasKey = false;
-    };
-
-    // A stretch of bytes that must hold exactly one item: the payload, or the
-    // content of a tag 24. Its item is complete when the frame stack is back
-    // to baseDepth.
-    struct Segment {
-        const std::uint8_t* data;
-        std::size_t size;
-        std::size_t position;
-        std::size_t baseDepth;
-    };
-
     MaybeError handle(const Event& event, std::size_t bytesLeft);
     MaybeError takeKey(Frame& map, const Event& event);
     MaybeError finishDate(const Event& event);
@@ -298,8 +320,10 @@ private:
     MaybeError deliver(Value value);
 
     std::span<const std::uint8_t> payload_;
-    std::vector<Segment> segments_;
-    std::vector<Frame> frames_;
+    DecoderStacks ownStacks_;  // only when the thread's are taken (never, today)
+    DecoderStacks& stacks_;
+    std::vector<Segment>& segments_;
+    std::vector<Frame>& frames_;
     std::optional<Value> root_;
     const std::size_t allowance_;
     std::size_t allocated_ = 0;

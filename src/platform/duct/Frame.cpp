@@ -34,17 +34,25 @@ void writeFrameHeader(std::uint8_t* sixteenBytes, const FrameHeader& header) {
     writeBigEndian32(sixteenBytes + 12, static_cast<std::uint32_t>(header.messageId));
 }
 
-std::optional<Bytes> encodeFrame(FrameKind kind, std::uint64_t messageId, const Value& payload) {
-    Bytes frame;
+bool encodeFrameInto(Bytes& frame, FrameKind kind, std::uint64_t messageId, const Value& payload) {
+    frame.clear();
     frame.reserve(kFrameHeaderSize + 256);  // the encoder's first claim fits: one allocation
     frame.resize(kFrameHeaderSize);
     cbor::encode(payload, frame);
     std::size_t payloadLength = frame.size() - kFrameHeaderSize;
     if (payloadLength > kMaxPayloadSize) {
-        return std::nullopt;
+        return false;
     }
     writeFrameHeader(frame.data(), FrameHeader{static_cast<std::uint32_t>(payloadLength),
                                                static_cast<std::uint32_t>(kind), messageId});
+    return true;
+}
+
+std::optional<Bytes> encodeFrame(FrameKind kind, std::uint64_t messageId, const Value& payload) {
+    Bytes frame;
+    if (!encodeFrameInto(frame, kind, messageId, payload)) {
+        return std::nullopt;
+    }
     return frame;
 }
 

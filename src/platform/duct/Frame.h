@@ -29,5 +29,8 @@ void writeFrameHeader(std::uint8_t* sixteenBytes, const FrameHeader& header);
 // A whole frame for the value: header followed by its CBOR encoding, in one
 // buffer ready to write. Nothing when the encoding exceeds kMaxPayloadSize.
 std::optional<Bytes> encodeFrame(FrameKind kind, std::uint64_t messageId, const Value& payload);
+// The same into a buffer the caller reuses (its content is replaced); false,
+// with the buffer's content undefined, when the encoding is too large.
+bool encodeFrameInto(Bytes& frame, FrameKind kind, std::uint64_t messageId, const Value& payload);
 
 }  // namespace qm::duct

@@ -17,6 +17,8 @@ namespace {
 constexpr std::size_t kMaxReadPerTurn = 256 * 1024;  // then other connections get their turn
 // Storage an idle connection keeps; what a bigger frame took is given back.
 constexpr std::size_t kKeptBufferCapacity = 64 * 1024;
+// A thread's reply buffer keeps no more than this between replies.
+constexpr std::size_t kKeptReplyBufferCapacity = 64 * 1024;
 constexpr std::size_t kMaxFrameSize = kFrameHeaderSize + kMaxPayloadSize;
 
 ucred socketCredentials(int socket) {
@@ -55,11 +57,17 @@ ReplyResult IncomingMessage::reply(const Value& reply) {
         finish();
         return ReplyResult::connectionGone;
     }
-    auto frame = encodeFrame(FrameKind::reply, id_, reply);
-    if (!frame) {
+    // Replies are encoded into one buffer per thread: a reply the socket takes
+    // whole costs no allocation; one that must wait takes the buffer along.
+    thread_local Bytes frame;
+    if (!encodeFrameInto(frame, FrameKind::reply, id_, reply)) {
+        Bytes().swap(frame);
         return ReplyResult::tooLarge;  // still unanswered: the caller may send a smaller reply
     }
-    ReplyResult result = connection->sendFrame(std::move(*frame));
+    ReplyResult result = connection->sendFrame(frame);
+    if (frame.capacity() > kKeptReplyBufferCapacity) {
+        Bytes().swap(frame);
+    }
     finish();
     return result;
 }
@@ -267,7 +275,7 @@ PeerConnection::Wait PeerConnection::deliverFrames() {
 
 void PeerConnection::consumeBuffered(std::size_t count, bool frameCompleted) {
     buffer_.consume(count);
-    budget_->releasePartial(*this, count, buffer_.empty(), frameCompleted);
+    budget_->releasePartial(count, frameCompleted);
     if (buffer_.empty() && buffer_.capacity() > kKeptBufferCapacity) {
         buffer_.release();
     }
@@ -316,7 +324,7 @@ void PeerConnection::resumeReceiving() {
     }
 }
 
-ReplyResult PeerConnection::sendFrame(Bytes frame) {
+ReplyResult PeerConnection::sendFrame(Bytes& frame) {
     std::lock_guard lock(writeMutex_);
     if (closed_.load()) {
         return ReplyResult::connectionGone;
@@ -445,6 +453,7 @@ void PeerConnection::closeNow(const std::string& reason) {
     if (!buffer_.empty()) {
         consumeBuffered(buffer_.size(), false);
     }
+    budget_->leave(*this);
     buffer_.release();
     bufferCapacity_.store(0);
     if (onClosed_) {

@@ -153,7 +153,9 @@ private:
 
     PeerConnection(EventLoop& loop, UniqueFd socket, std::optional<PeerIdentity> identity,
                    std::shared_ptr<ReceiveBudget> budget, std::function<void()> onClosed);
-    ReplyResult sendFrame(Bytes frame);
+    // Sends what the socket takes now; what it does not, waits in the
+    // backlog, which then takes the frame's storage.
+    ReplyResult sendFrame(Bytes& frame);
     void releaseRequestSlot();
     void postResumeAfterAnswer();
     Wait receive(bool& hungUp);

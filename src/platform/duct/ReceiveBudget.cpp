@@ -24,24 +24,27 @@ std::size_t ReceiveBudget::receiveAllowance(std::size_t held) const noexcept {
 void ReceiveBudget::chargePartial(const std::shared_ptr<Member>& member, std::size_t bytes) {
     std::size_t before = partial_.load();
     partial_.store(before + bytes);
-    holders_.try_emplace(member.get(), member);
+    // A member stays listed from its first bytes until it leaves, so a
+    // request costs no map node.
+    holders_.insert_or_assign(member.get(), member);
     if (before < limits_.partialBytes && before + bytes >= limits_.partialBytes) {
         noteFull();
     }
 }
 
-void ReceiveBudget::releasePartial(Member& member, std::size_t bytes, bool holdsNone, bool frameCompleted) {
+void ReceiveBudget::releasePartial(std::size_t bytes, bool frameCompleted) {
     assert(partial_.load() >= bytes);
     partial_.store(partial_.load() - bytes);
-    if (holdsNone) {
-        holders_.erase(&member);
-    }
     if (frameCompleted) {
         lastCompletion_ = Clock::now();
     }
     if (waiting_[index(Pool::partial)].load() > 0 && partial_.load() < limits_.partialBytes) {
         scheduleResume();
     }
+}
+
+void ReceiveBudget::leave(Member& member) noexcept {
+    holders_.erase(&member);
 }
 
 void ReceiveBudget::forget(Member& member, std::size_t bytes) noexcept {

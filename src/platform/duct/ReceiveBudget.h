@@ -82,9 +82,11 @@ public:
     // `held` may receive now; 0 means it must wait.
     std::size_t receiveAllowance(std::size_t held) const noexcept;
     void chargePartial(const std::shared_ptr<Member>& member, std::size_t bytes);
-    // `holdsNone`: the member holds no bytes any more. `frameCompleted`: a
-    // whole frame left the pool, which counts as progress against stalls.
-    void releasePartial(Member& member, std::size_t bytes, bool holdsNone, bool frameCompleted);
+    // `frameCompleted`: a whole frame left the pool, which counts as
+    // progress against stalls.
+    void releasePartial(std::size_t bytes, bool frameCompleted);
+    // The member closed: it is no candidate for dropping any more.
+    void leave(Member& member) noexcept;
     // For a member destroyed without closing, once its loop has stopped:
     // takes its bytes off the pool and wakes nobody.
     void forget(Member& member, std::size_t bytes) noexcept;
@@ -114,7 +116,7 @@ private:
     std::atomic<std::size_t> decoded_{0};
 
     // Loop thread only.
-    std::unordered_map<Member*, std::weak_ptr<Member>> holders_;  // members holding partial bytes
+    std::unordered_map<Member*, std::weak_ptr<Member>> holders_;  // members that received bytes, until they leave
     std::array<std::deque<std::weak_ptr<Member>>, 2> waiters_;
     Member* resuming_ = nullptr;  // the member resumeWaiters() is trying, and for which pool
     Pool resumingPool_ = Pool::partial;

@@ -142,6 +142,8 @@ public:
 
     void set(std::string key, Value value);
     void remove(std::string_view key);
+    // Room for this many entries, so that setting them allocates once.
+    void reserve(std::size_t entries) { entries_.reserve(entries); }
 
     // A copy with one key set, or removed when the value is nothing.
     Dictionary changing(std::string_view key, std::optional<Value> value) const;
