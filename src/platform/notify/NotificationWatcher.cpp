@@ -6,6 +6,8 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <set>
+#include <string_view>
 #include <vector>
 
 #include "platform/file/FolderEntries.h"
@@ -21,13 +23,14 @@ constexpr std::uint32_t kWatchEnds = IN_DELETE_SELF | IN_MOVE_SELF | IN_IGNORED;
 // What one drain of the inotify queue found.
 struct Landings {
     std::vector<std::string> names;  // in order of arrival, each once
+    std::set<std::string, std::less<>> known;
     bool overflowed = false;
     bool watchEnded = false;
     MaybeError failure;
 
-    void add(std::string name) {
-        if (isNotificationName(name) && std::find(names.begin(), names.end(), name) == names.end()) {
-            names.push_back(std::move(name));
+    void add(std::string_view name) {
+        if (isNotificationName(name) && known.emplace(name).second) {
+            names.emplace_back(name);
         }
     }
 };
@@ -39,10 +42,10 @@ void readEvents(int fd, Landings& landings) {
         if (n < 0 && errno == EINTR) {
             continue;
         }
-        if (n < 0) {
-            if (errno != EAGAIN) {
-                landings.failure = posixError(errno, "reading notification events");
-            }
+        if (n < 0 && errno != EAGAIN) {
+            landings.failure = posixError(errno, "reading notification events");
+        }
+        if (n <= 0) {
             return;
         }
         std::size_t offset = 0;
@@ -58,7 +61,7 @@ void readEvents(int fd, Landings& landings) {
                 landings.watchEnded = true;
             }
             if ((event.mask & IN_MOVED_TO) != 0 && event.len > 0) {
-                landings.add(std::string(name, ::strnlen(name, event.len)));
+                landings.add(std::string_view(name, ::strnlen(name, event.len)));
             }
         }
     }
@@ -67,8 +70,8 @@ void readEvents(int fd, Landings& landings) {
 void addEveryName(const std::string& directory, Landings& landings) {
     auto names = folderEntryNames(directory);
     if (names) {
-        for (std::string& name : *names) {
-            landings.add(std::move(name));
+        for (const std::string& name : *names) {
+            landings.add(name);
         }
     }
 }

@@ -61,6 +61,10 @@ bool PreferenceDomain::synchronize() {
     UniqueFd fd(::open(path_.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
     if (!fd) {
         int error = errno;
+        if (error == ENOENT || error == ENOTDIR) {  // removed since the stat
+            forgetValues(std::nullopt);
+            return false;
+        }
         forgetValues(seen);
         reportDamage(seen, std::strerror(error));
         return true;
@@ -77,7 +81,7 @@ bool PreferenceDomain::synchronize() {
     const Dictionary* root = parsed->asDictionary();
     if (root == nullptr) {
         forgetValues(seen);
-        reportDamage(seen, std::string("its top is a ") + valueTypeName(parsed->type()) + ", not a dictionary");
+        reportDamage(seen, std::string("its top is of type ") + valueTypeName(parsed->type()) + ", not a dictionary");
         return true;
     }
     values_ = *root;

@@ -35,8 +35,9 @@ public:
     // when it was modified less than 2 s ago (two writes within one tick of
     // the file system's clock can leave that stamp alike). So a change
     // written before this call, in place or by rename, is seen after it.
-    // Costs one stat when nothing changed. Returns true when the file's
-    // content was read, false when the values were kept or there is no file.
+    // Costs one stat when nothing changed. Returns true when it went to the
+    // file's content again (whatever it found there), false when it kept the
+    // values of an unchanged file or found no file.
     bool synchronize();
 
     // The value under key as of the last synchronize(); nothing before the
