@@ -147,6 +147,16 @@ std::string xdgStateHome() {
     return home() + "/.local/state";
 }
 
+std::vector<std::string> xdgDataDirectories() {
+    if (auto list = variable("XDG_DATA_DIRS")) {
+        auto directories = splitColons(*list);
+        if (!directories.empty()) {
+            return directories;
+        }
+    }
+    return {"/usr/local/share", "/usr/share"};
+}
+
 std::string catalogDatabasePath() {
     if (auto v = variable("QM_CATALOG_DB")) {
         return *v;

@@ -44,6 +44,10 @@ std::string xdgDataHome();
 std::string xdgConfigHome();
 std::string xdgStateHome();
 
+// $XDG_DATA_DIRS (colon-separated, empty entries dropped), else
+// /usr/local/share then /usr/share; most important first.
+std::vector<std::string> xdgDataDirectories();
+
 // The catalog database: $QM_CATALOG_DB, else $XDG_DATA_HOME/ovaro/AppCatalog.db.
 std::string catalogDatabasePath();
 
