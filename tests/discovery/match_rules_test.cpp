@@ -13,12 +13,15 @@ using qm::Array;
 using qm::Dictionary;
 using qm::Value;
 
+// A small mime database: an alias, and a chain of two parents.
+std::string writeMimeDatabase(const qmtest::TempDir& dir) {
+    qmtest::writeFile(dir.file("mime/subclasses"), "image/svg+xml application/xml\napplication/xml text/plain\n");
+    qmtest::writeFile(dir.file("mime/aliases"), "image/x-svg image/svg+xml\n");
+    return dir.file("mime");
+}
+
 class MatchRulesTest : public ::testing::Test {
 protected:
-    MatchRulesTest() {
-        qmtest::writeFile(dir.file("mime/subclasses"), "image/svg+xml application/xml\napplication/xml text/plain\n");
-        qmtest::writeFile(dir.file("mime/aliases"), "image/x-svg image/svg+xml\n");
-    }
     PlugInFacts facts(std::optional<Value> election = std::nullopt) const {
         PlugInFacts f;
         f.identifier = "com.example.share";
@@ -35,7 +38,7 @@ protected:
         return f;
     }
     qmtest::TempDir dir;
-    qm::UniformTypes types = qm::UniformTypes::fromMimeDirectories({dir.file("mime")});
+    qm::UniformTypes types = qm::UniformTypes::fromMimeDirectories({writeMimeDatabase(dir)});
     MatchRules rules{types};
 };
 
