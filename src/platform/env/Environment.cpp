@@ -164,6 +164,14 @@ std::string catalogDatabasePath() {
     return xdgDataHome() + "/ovaro/AppCatalog.db";
 }
 
+std::string userApplicationsRoot() {
+    return xdgDataHome() + "/ovaro/Applications";
+}
+
+std::string dataContainersDirectory() {
+    return xdgDataHome() + "/ovaro/Containers";
+}
+
 std::optional<std::string> userLanguage() {
     for (const char* name : {"LANGUAGE", "LC_ALL", "LC_MESSAGES", "LANG"}) {
         auto v = variable(name);

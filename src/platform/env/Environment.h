@@ -51,6 +51,12 @@ std::vector<std::string> xdgDataDirectories();
 // The catalog database: $QM_CATALOG_DB, else $XDG_DATA_HOME/ovaro/AppCatalog.db.
 std::string catalogDatabasePath();
 
+// The user's install root: $XDG_DATA_HOME/ovaro/Applications.
+std::string userApplicationsRoot();
+
+// The folder of plug-in data containers: $XDG_DATA_HOME/ovaro/Containers.
+std::string dataContainersDirectory();
+
 // The user's language: the first of LANGUAGE, LC_ALL, LC_MESSAGES, LANG that
 // is set and not empty, cut before "_", "." or "@" (and before ":" for
 // LANGUAGE lists); nothing when none is set.
