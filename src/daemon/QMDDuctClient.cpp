@@ -3,6 +3,7 @@
 #include "daemon/QMDServer.h"
 #include "daemon/Transaction.h"
 #include "platform/codesign/Entitlements.h"
+#include "platform/sandbox/Sandboxed.h"
 
 namespace {
 
@@ -29,6 +30,7 @@ ClientIdentity identityOf(const qm::duct::PeerConnection& connection) {
     if (identity.bundle) {
         identity.entitlements = qm::readEntitlements(identity.bundle->directory());
     }
+    identity.sandboxed = qm::isProcessSandboxed(identity.pid, identity.pidfd ? identity.pidfd->get() : -1);
     return identity;
 }
 

@@ -6,6 +6,8 @@
 
 #include "daemon/QMDDuctClient.h"
 #include "platform/duct/OpenTransaction.h"
+#include "platform/env/Environment.h"
+#include "platform/launcher/ServiceLauncher.h"
 
 namespace {
 
@@ -57,12 +59,41 @@ QMDServer* QMDServer::server() {
     return processServer.load();
 }
 
+namespace {
+
+constexpr const char* kAnnotationChange = "ovaro.quamber.annotation-change";
+
+}  // namespace
+
 QMDServer::QMDServer(std::unique_ptr<qm::EventLoop> loop, std::unique_ptr<QMDatabase> registry)
-    : loop_(std::move(loop)), registry_(std::move(registry)), holds_(nullptr) {}
+    : loop_(std::move(loop)),
+      registry_(std::move(registry)),
+      notifications_(qm::ductRuntimeDirectory()),
+      holds_([this] { (void)notifications_.post(kAnnotationChange); }) {
+    registry_->setAnnotationsChanged([this] { (void)notifications_.post(kAnnotationChange); });
+    registry_->setDelegate([this](const std::vector<qm::PlugInRecordPtr>& records) { removedPlugIns(records); });
+}
 
 void QMDServer::run() {
+    // Counts restart with the daemon (a failure was logged by the poster).
+    (void)notifications_.reset();
     registry_->whenReady([this] { loop_->post([this] { resumeListener(); }); });
     loop_->run();
+}
+
+void QMDServer::removedPlugIns(const std::vector<qm::PlugInRecordPtr>& records) {
+    mainQueue_->asyncOnWorker([this, records] {
+        for (const auto& record : records) {
+            if (!record->bundleIdentifier) {
+                continue;
+            }
+            int result = qm::removeExternalService(qm::ductRuntimeDirectory(), *record->bundleIdentifier,
+                                                   record->bundleVersion.value_or(""));
+            if (result != qm::kServiceRemoved && result != qm::kNoSuchService) {
+                log("PLUGIN REMOVAL:%@ RESULT:%d", *record->bundleIdentifier, result);
+            }
+        }
+    });
 }
 
 void QMDServer::stop() {

@@ -18,8 +18,10 @@
 #include <optional>
 #include <string>
 
+#include "discovery/QMDUserPrefs.h"
 #include "platform/duct/Listener.h"
 #include "platform/log/Logger.h"
+#include "platform/notify/NotificationPoster.h"
 #include "platform/process/TerminationSignals.h"
 #include "platform/queue/EventLoop.h"
 #include "platform/queue/SerialQueue.h"
@@ -72,6 +74,12 @@ public:
 
     QMDatabase& registry() noexcept { return *registry_; }
     HoldList& holds() noexcept { return holds_; }
+    QMDUserPrefs& userPrefs() noexcept { return userPrefs_; }  // mainQueue only
+    qm::NotificationPoster& notifications() noexcept { return notifications_; }
+
+    // The registry's delegate: the catalog uninstalls these plug-ins, whose
+    // services go (on mainQueue, never waiting for it).
+    void removedPlugIns(const std::vector<qm::PlugInRecordPtr>& records);
     qm::SerialQueue& ductQueue() noexcept { return *ductQueue_; }
     qm::SerialQueue& mainQueue() noexcept { return *mainQueue_; }
     qm::SerialQueue& syncQueue() noexcept { return holds_.syncQueue(); }
@@ -95,7 +103,9 @@ private:
     std::atomic<bool> stopping_{false};
     std::unique_ptr<qm::EventLoop> loop_;
     std::unique_ptr<QMDatabase> registry_;
+    qm::NotificationPoster notifications_;
     HoldList holds_;
+    QMDUserPrefs userPrefs_;
     std::unique_ptr<qm::SerialQueue> ductQueue_;
     std::unique_ptr<qm::SerialQueue> mainQueue_;
     std::shared_ptr<qm::duct::Listener> service_;

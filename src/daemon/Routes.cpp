@@ -1,18 +1,20 @@
 #include "daemon/Routes.h"
 
+#include "discovery/MatchRequest.h"
+#include "registry/AnnotateRequest.h"
 #include "registry/RegistrationRequests.h"
 
 namespace {
 
 // Compared in this order.
 constexpr Route kRoutes[] = {
-    {"add", nullptr, false},
-    {"remove", nullptr, false},
+    {"add", &addPlugIns, false},
+    {"remove", &removePlugIns, false},
     {"bulk", &bulkPlugIns, true},
-    {"match", nullptr, false},
+    {"match", &matchPlugIns, false},
     {"ready", nullptr, false},
     {"access", nullptr, false},
-    {"annotate", nullptr, false},
+    {"annotate", &annotatePlugIns, false},
     {"lock", nullptr, false},
 };
 

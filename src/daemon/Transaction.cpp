@@ -80,8 +80,8 @@ void Transaction::dispatch() {
         failWithMessage(kQMErrorInvalidRequest, kUnrecognized);
         return;
     }
-    RequestContext context{server().registry(), server().holds(), server().logger(), client_->identity(),
-                           client_,           request(),       version_};
+    RequestContext context{server().registry(), server().holds(), server().userPrefs(), server().logger(),
+                           client_->identity(), client_, request(), version_};
     finish(route->handler(context));
 }
 

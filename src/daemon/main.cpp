@@ -44,14 +44,20 @@ int main(int argc, char** argv) {
     if (!idleExit) {
         return failStartUp(idleExit.error().text());
     }
-    auto server = QMDServer::initForService(options->serviceName,
-                                            std::make_unique<QMDatabase>(options->databasePath), *idleExit);
+    auto catalog = qm::AppCatalog::open(qm::AppCatalogOptions::fromEnvironment());
+    if (!catalog) {
+        return failStartUp(catalog.error().text());
+    }
+    auto registry = QMDatabase::initWithDatabase(options->databasePath, std::move(catalog).value());
+    if (!registry) {
+        return failStartUp(registry.error().text());
+    }
+    auto server = QMDServer::initForService(options->serviceName, std::move(registry).value(), *idleExit);
     if (!server) {
         return failStartUp(server.error().text());
     }
     (*server)->setVerbose(options->verbosity);
-    // The registry has nothing to scan yet: it is ready at once.
-    (*server)->registry().markReady();
+    (*server)->registry().start();
     (*server)->run();
     return EXIT_SUCCESS;
 }

@@ -81,3 +81,7 @@ const qm::Dictionary* QMGetDuctDictionary(const qm::Value& message, std::string_
     const qm::Value* value = message.get(key);
     return value ? value->asDictionary() : nullptr;
 }
+
+bool entitlementGranted(const std::optional<qm::Value>& value) {
+    return value && !(*value == qm::Value(false)) && !(value->isNumber() && *value == qm::Value(0));
+}

@@ -32,3 +32,8 @@ std::strong_ordering compareVersionString(std::string_view a, std::string_view b
 // The pointer lives as long as message.
 const qm::Array* QMGetDuctArray(const qm::Value& message, std::string_view key);
 const qm::Dictionary* QMGetDuctDictionary(const qm::Value& message, std::string_view key);
+
+// Whether an entitlement's value grants it: it exists and is neither the
+// Boolean false nor a number equal to zero (any other value, the string "NO"
+// included, grants).
+bool entitlementGranted(const std::optional<qm::Value>& value);

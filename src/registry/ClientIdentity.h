@@ -27,6 +27,8 @@ struct ClientIdentity {
     std::optional<QMBundle> bundle;
     // The code-signing view of the client: its bundle's trusted entitlements.
     std::optional<qm::Value> entitlements;
+    // More confined than the daemon (seccomp, no_new_privs, namespaces).
+    bool sandboxed = true;
 
     std::optional<qm::Value> entitlementValueForKey(std::string_view key) const;
     // Granted when a value exists and is not boolean false.

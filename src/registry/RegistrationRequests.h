@@ -1,8 +1,11 @@
 #pragma once
-// The registration requests: "bulk" (and, with the catalog, "add" and "remove").
+// The registration requests: "add" and "remove" register and unregister
+// plug-in bundles with the catalog; "bulk" is a placeholder for batch
+// options that are not supported. "add" and "remove" wait for the catalog's
+// commit; "bulk" blocks nothing and may run on the reading thread.
 
 #include "registry/Request.h"
 
-// "bulk": batch options are not supported; it logs the options it was given
-// and succeeds. Cheap and blocking nothing, so it may run on the reading thread.
+Reply addPlugIns(RequestContext& context);
+Reply removePlugIns(RequestContext& context);
 Reply bulkPlugIns(RequestContext& context);

@@ -17,6 +17,7 @@
 
 class HoldList;
 class QMDatabase;
+class QMDUserPrefs;  // discovery's; only discovery reads it
 
 // A handler's answer: the result keys and, for a failure, its code and
 // message (a failure may still carry result keys, as "lock" carries
@@ -42,6 +43,7 @@ struct Reply {
 struct RequestContext {
     QMDatabase& registry;
     HoldList& holds;
+    QMDUserPrefs& userPrefs;
     const qm::Logger& logger;
     const ClientIdentity& client;
     // The client as a hold refers to it: weakly, and only to ask whether it

@@ -47,13 +47,23 @@ private:
 
 class InProcessServer : public ::testing::Test {
 protected:
-    void start(bool registryReady) {
-        auto created = QMDServer::initForService("inprocess.qmd", std::make_unique<QMDatabase>(std::nullopt));
+    // The registry's catalog scans an empty root; until `scanned`, it has
+    // not even begun.
+    void start(bool scanned) {
+        qm::AppCatalogOptions catalogOptions;
+        catalogOptions.databasePath = dir.file("catalog.db");
+        catalogOptions.userRoot = dir.file("Applications");
+        catalogOptions.containersDirectory = dir.file("Containers");
+        auto catalog = qm::AppCatalog::open(catalogOptions);
+        ASSERT_TRUE(catalog) << catalog.error().text();
+        auto registry = QMDatabase::initWithDatabase(dir.file("Annotations"), std::move(catalog).value());
+        ASSERT_TRUE(registry) << registry.error().text();
+        auto created = QMDServer::initForService("inprocess.qmd", std::move(registry).value());
         ASSERT_TRUE(created) << created.error().text();
         server = *created;
         server->setVerbose(1);
-        if (registryReady) {
-            server->registry().markReady();
+        if (scanned) {
+            server->registry().start();
         }
         loop = std::thread([this] { server->run(); });
     }
@@ -72,12 +82,12 @@ protected:
 };
 
 TEST_F(InProcessServer, NothingIsAnsweredBeforeTheRegistryIsReady) {
-    start(/*registryReady=*/false);
+    start(/*scanned=*/false);
     qmtest::FramePeer early(socketPath);
     ASSERT_TRUE(early.connected()) << "connecting waits in the backlog";
     auto id = early.send(qmtest::bulk());
     EXPECT_FALSE(early.receive(std::chrono::milliseconds(300))) << "answered before the first scan";
-    server->registry().markReady();
+    server->registry().start();
     auto reply = early.receive();
     ASSERT_TRUE(reply);
     EXPECT_EQ(reply->id, id);
@@ -85,7 +95,7 @@ TEST_F(InProcessServer, NothingIsAnsweredBeforeTheRegistryIsReady) {
 }
 
 TEST_F(InProcessServer, ALongHandlerNeitherDelaysAcceptsNorHangUpsNorServesTheDead) {
-    start(/*registryReady=*/true);
+    start(/*scanned=*/true);
     std::string pid = std::to_string(::getpid());
     MainQueueBlocker longHandler(*server);
     {

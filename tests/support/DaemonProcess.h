@@ -43,6 +43,8 @@ public:
     const std::string& runtimeDirectory() const { return runtimeDirectory_; }
     std::string socketPath() const { return runtimeDirectory_ + "/" + serviceName_; }
     const std::string& serviceName() const { return serviceName_; }
+    // A file in the daemon's private folder (its XDG_* homes live there).
+    std::string scratchPath(const std::string& name) const { return scratch_.file(name); }
 
     // What the daemon wrote to standard error so far (its log, QM_LOG_STDERR=1).
     std::string log() const;

@@ -1,0 +1,207 @@
+// A real qmd over a catalog of the example applications: "match" with its
+// filters and explanations, "annotate" and its notification, "add" and
+// "remove", and installs seen while it runs.
+
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <set>
+#include <thread>
+
+#include "platform/plist/PropertyList.h"
+#include "support/DaemonProcess.h"
+#include "support/FramePeer.h"
+
+namespace {
+
+using qm::Array;
+using qm::Dictionary;
+using qm::Value;
+using qmtest::errorCode;
+using qmtest::errorText;
+
+namespace fs = std::filesystem;
+
+class Discovery : public ::testing::Test {
+protected:
+    Discovery() {
+        fs::copy(fs::path(QM_SOURCE_DIR) / "examples/Applications", roots.file("system"), fs::copy_options::recursive);
+        qmd = std::make_unique<qmtest::DaemonProcess>(options());
+        client = std::make_unique<qmtest::FramePeer>(qmd->socketPath());
+    }
+    qmtest::DaemonOptions options() {
+        qmtest::DaemonOptions options = qmtest::withEnvironment(
+            {{"QM_SYSTEM_ROOTS", roots.file("system")}, {"QM_SDK_PATH", std::string(QM_SOURCE_DIR) + "/examples/SDKs"}});
+        options.arguments = {"-v"};
+        return options;
+    }
+    Value send(std::initializer_list<Dictionary::Entry> entries) {
+        Dictionary request(entries);
+        request.set("version", Value(std::uint64_t{3}));
+        auto reply = client->roundTrip(Value(std::move(request)));
+        EXPECT_TRUE(reply);
+        return reply.value_or(Value());
+    }
+    Value match(Dictionary rules, std::uint64_t flags = 0, bool explain = false) {
+        return send({{"request", Value("match")}, {"rules", Value(std::move(rules))}, {"flags", Value(flags)},
+                     {"explain", Value(explain)}});
+    }
+    static std::vector<std::string> identifiers(const Value& reply, const char* key = "matches") {
+        std::vector<std::string> found;
+        const Value* packed = reply.get(key);
+        const Value* forms = packed ? packed->packedContent() : nullptr;
+        for (const Value& form : forms && forms->asArray() ? *forms->asArray() : Array{}) {
+            found.push_back(*form.get("identifier")->asString());
+        }
+        return found;
+    }
+    static const Value* form(const Value& reply, const std::string& identifier) {
+        for (const Value& form : *reply.get("matches")->packedContent()->asArray()) {
+            if (*form.get("identifier")->asString() == identifier) {
+                return &form;
+            }
+        }
+        return nullptr;
+    }
+
+    qmtest::TempDir roots;
+    std::unique_ptr<qmtest::DaemonProcess> qmd;
+    std::unique_ptr<qmtest::FramePeer> client;
+};
+
+TEST_F(Discovery, RulesSelectAmongTheInstalledPlugInsInPathOrder) {
+    struct Case {
+        const char* name;
+        Dictionary rules;
+        std::vector<std::string> expected;
+    };
+    const Case cases[] = {
+        {"one extension point", {{"VTExtensionPointName", Value("ovaro.share-services")}}, {"ovaro.example.notes.share"}},
+        {"with the election filter", {{"VTExtensionPointName", Value("ovaro.share-services")}, {"VTUserElection", Value("1")}}, {}},
+        {"an operator falls back to every plug-in",
+         {{"VTExtensionPointName", Value(">ovaro.share-services")}},
+         {"ovaro.example.notes.widget"}},
+        {"two plug-ins of one multiplexed bundle",
+         {{"VTExtensionPointName", Value("ovaro.image-filter")}},
+         {"ovaro.example.studio.blur", "ovaro.example.studio.sharpen"}},
+    };
+    for (const Case& c : cases) {
+        EXPECT_EQ(identifiers(match(c.rules)), c.expected) << c.name;
+    }
+    EXPECT_EQ(errorCode(send({{"request", Value("match")}, {"rules", Value("x")}})), 4u);
+    auto v2 = client->roundTrip(qmtest::request({{"request", Value("match")}, {"version", Value(std::uint64_t{2})}}));
+    ASSERT_TRUE(v2);
+    EXPECT_EQ(*v2, Value(Dictionary{})) << "version 2 has no matches";
+    EXPECT_EQ(errorText(match({}, 0x200)), "unauthorized discovery flag (QMDiscoverAll)");
+}
+
+TEST_F(Discovery, ExplanationsSayWhyEachCandidateWasLeftOut) {
+    Value reply = match({{"VTExtensionPointName", Value(">a")}, {"Category", Value("notes")}}, 0, true);
+    const Value* packed = reply.get("explanations");
+    ASSERT_TRUE(packed && packed->packedContent()) << reply.description();
+    std::map<std::string, std::pair<std::string, std::string>> why;
+    for (const Value& entry : *packed->packedContent()->asArray()) {
+        why[*entry.get("identifier")->asString()] = {*entry.get("step")->asString(), *entry.get("detail")->asString()};
+    }
+    EXPECT_EQ(why["ovaro.example.notes.widget"], std::make_pair(std::string("rules"), std::string("Category")));
+    EXPECT_EQ(why["ovaro.example.studio.passproxy"].first, "misconfigured");
+    EXPECT_FALSE(why.contains("ovaro.example.notes.share")) << "offered, so not explained";
+    EXPECT_EQ(identifiers(reply), std::vector<std::string>{"ovaro.example.notes.share"});
+}
+
+TEST_F(Discovery, AnElectionIsStoredAnnouncedAndSelectable) {
+    Value before = match({{"VTExtensionPointName", Value("ovaro.share-services")}});
+    ASSERT_TRUE(form(before, "ovaro.example.notes.share"));
+    Value uuid = Value(*qm::Uuid::parse(*form(before, "ovaro.example.notes.share")->get("uuid")->asString()));
+    EXPECT_EQ(*form(before, "ovaro.example.notes.share")->get("annotations"), Value(Dictionary{}));
+
+    struct Case {
+        Dictionary annotations;
+        std::optional<std::string> error;
+    };
+    const Case refused[] = {
+        {{{"election", Value("1")}}, "invalid request format (annotation election)"},
+        {{{"extension", Value(1)}}, "invalid request format (annotation extension)"},
+    };
+    for (const Case& c : refused) {
+        EXPECT_EQ(errorText(send({{"request", Value("annotate")}, {"uuids", Value(Array{uuid})}, {"annotations", Value(c.annotations)}})),
+                  *c.error);
+    }
+    EXPECT_EQ(send({{"request", Value("annotate")}, {"annotations", Value(Dictionary{{"other", Value(1)}})}}),
+              Value(Dictionary{})) << "nothing to store: the uuids are not read";
+    Value annotated = send({{"request", Value("annotate")},
+                            {"uuids", Value(Array{uuid})},
+                            {"annotations", Value(Dictionary{{"election", Value(1)}})}});
+    EXPECT_EQ(annotated, Value(Dictionary{}));
+    // Posted before the reply.
+    EXPECT_EQ(qmtest::readFile(qmd->runtimeDirectory() + "/notify/ovaro.quamber.annotation-change"), "1");
+    Value elected = match({{"VTExtensionPointName", Value("ovaro.share-services")}, {"VTUserElection", Value("1")}});
+    ASSERT_TRUE(form(elected, "ovaro.example.notes.share"));
+    EXPECT_EQ(*form(elected, "ovaro.example.notes.share")->get("annotations"), Value(Dictionary{{"election", Value(1)}}));
+}
+
+TEST_F(Discovery, AddAndRemoveRegisterByPathAndRefuseWhatIsNoPlugIn) {
+    std::string outside = roots.file("outside/Extra.bundle");
+    fs::create_directories(roots.file("outside"));
+    fs::copy(roots.file("system/Notes.app/PlugIns/Spelling.bundle"), outside, fs::copy_options::recursive);
+    std::string extraInfo = outside + "/Info.plist";
+    auto info = qm::plist::readFile(extraInfo);
+    ASSERT_TRUE(info);
+    qm::Dictionary changed = *info->asDictionary();
+    changed.set("MRBundleIdentifier", Value("ovaro.example.extra"));
+    ASSERT_FALSE(qm::plist::writeFileAtomically(extraInfo, Value(changed), qm::plist::Format::xml));
+
+    struct Case {
+        const char* request;
+        std::string path;
+        std::optional<std::uint64_t> code;
+        std::string error;
+    };
+    const Case cases[] = {
+        {"add", "relative/path", 9, "absolute path required: relative/path"},
+        {"add", roots.file("missing"), 9, "invalid plugin path: " + roots.file("missing")},
+        {"add", roots.file("system/Notes.app"), 9, "invalid plugin path: " + roots.file("system/Notes.app")},
+        {"add", roots.file("outside"), 2, "unable to register plug-in at " + roots.file("outside")},
+        {"add", outside, std::nullopt, ""},
+        {"remove", outside, std::nullopt, ""},
+        {"remove", outside, 9, "no plugin at " + outside},
+    };
+    for (const Case& c : cases) {
+        Value reply = send({{"request", Value(c.request)}, {"paths", Value(Array{Value(c.path)})}});
+        EXPECT_EQ(errorCode(reply), c.code) << c.request << " " << c.path;
+        EXPECT_EQ(errorText(reply), c.error) << c.request << " " << c.path;
+    }
+    EXPECT_TRUE(qmd->waitForLog("INSTALLED:ovaro.example.extra"));
+    EXPECT_TRUE(qmd->waitForLog("UNINSTALLED:ovaro.example.extra"));
+}
+
+TEST_F(Discovery, ApplicationsInstalledAndRemovedWhileRunningAreSeen) {
+    Dictionary rules{{"VTExtensionPointName", Value("ovaro.widget")}};
+    ASSERT_EQ(identifiers(match(rules)), std::vector<std::string>{"ovaro.example.notes.widget"});
+    fs::rename(roots.file("system/Notes.app"), roots.file("Notes.app"));
+    EXPECT_TRUE(qmd->waitForLog("UNINSTALLED:ovaro.example.notes.widget")) << qmd->log();
+    EXPECT_TRUE(identifiers(match(rules)).empty());
+    fs::rename(roots.file("Notes.app"), roots.file("system/Notes.app"));
+    // Seen again, under a new UUID.
+    std::string uuidBefore = *form(match({}), "ovaro.example.studio.blur")->get("uuid")->asString();
+    for (int i = 0; i < 500 && identifiers(match(rules)).empty(); ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    EXPECT_EQ(identifiers(match(rules)), std::vector<std::string>{"ovaro.example.notes.widget"});
+    EXPECT_EQ(*form(match({}), "ovaro.example.studio.blur")->get("uuid")->asString(), uuidBefore)
+        << "an untouched application keeps its plug-ins' UUIDs";
+}
+
+TEST_F(Discovery, TheUsersExclusionsAreReadAgainWhenTheyChange) {
+    Dictionary rules{{"VTExtensionPointName", Value("ovaro.share-services")}};
+    ASSERT_EQ(identifiers(match(rules)).size(), 1u);
+    Value exclusions(Dictionary{
+        {"exclusions", Value(Array{Value(Dictionary{{"VTExtensionIdentifier", Value("ovaro.example.notes.share")}})})}});
+    std::string prefs = qmd->scratchPath("config/ovaro/ovaro.quamber.userprefs.plist");
+    fs::create_directories(fs::path(prefs).parent_path());
+    ASSERT_FALSE(qm::plist::writeFileAtomically(prefs, exclusions, qm::plist::Format::binary));
+    EXPECT_TRUE(identifiers(match(rules)).empty());
+    EXPECT_TRUE(qmd->waitForLog("plugin ovaro.example.notes.share excluded"));
+}
+
+}  // namespace
