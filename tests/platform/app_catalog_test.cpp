@@ -1,10 +1,13 @@
 #include "platform/catalog/AppCatalog.h"
+#include "platform/catalog/PlugInBundleReader.h"
+#include "platform/catalog/PlugInDeclarations.h"
 
 #include <gtest/gtest.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <filesystem>
 #include <functional>
@@ -70,9 +73,19 @@ bool eventually(const std::function<bool()>& condition) {
     return false;
 }
 
+// Records what it is told; checks that lookups, which never wait for the
+// catalog's thread, already answer for what it is told was installed.
 class Recorder : public qm::AppCatalogObserver {
 public:
-    void pluginsDidInstall(const std::vector<PlugInRecordPtr>& records) override { add(installed_, records); }
+    const AppCatalog* catalog = nullptr;
+    std::atomic<int> unseen{0};
+
+    void pluginsDidInstall(const std::vector<PlugInRecordPtr>& records) override {
+        for (const auto& record : records) {
+            unseen += catalog->plugInWithUuid(record->uuid) == record ? 0 : 1;
+        }
+        add(installed_, records);
+    }
     void pluginsWillUninstall(const std::vector<PlugInRecordPtr>& records) override { add(uninstalled_, records); }
     std::vector<PlugInRecordPtr> installed() const { return copy(installed_); }
     std::vector<PlugInRecordPtr> uninstalled() const { return copy(uninstalled_); }
@@ -123,9 +136,15 @@ protected:
         auto opened = AppCatalog::open(given ? *given : options());
         ASSERT_TRUE(opened) << opened.error().text();
         catalog = std::move(opened).value();
+        recorder->catalog = catalog.get();
         catalog->addObserver(recorder);
         catalog->start();
         catalog->waitUntilReady();
+    }
+
+    void TearDown() override {
+        ASSERT_TRUE(recorder);
+        EXPECT_EQ(recorder->unseen.load(), 0);
     }
 
     PlugInRecordPtr byIdentifier(const std::string& identifier) const {
@@ -273,12 +292,15 @@ TEST_F(AppCatalogTest, RestartKeepsIdentityAndReadsOnlyWhatChanged) {
     writeBundle(plugIns + "Same.bundle", plugInInfo("r.same", "p"));
     writeBundle(plugIns + "Changed.bundle", plugInInfo("r.changed", "p"));
     std::string entitled = writeBundle(plugIns + "Entitled.bundle", plugInInfo("r.entitled", "p"));
+    writePlist(plugIns + "Same.bundle/de.lproj/InfoPlist.strings", Value(Dict{{"MRBundleName", Value("Gleich")}}));
     writeBundle(plugIns + "Gone.bundle", plugInInfo("r.gone", "p"));
     std::string outside = writeBundle(base + "/loose/Added.bundle", plugInInfo("r.added", "p"));
     open();
     ASSERT_FALSE(catalog->registerPlugIn(outside));
     auto before = catalog->installedPlugIns();
     ASSERT_EQ(before.size(), 5u);
+    PlugInRecordPtr same = byIdentifier("r.same");
+    EXPECT_EQ(same->localizedShortName, "r.same name");
     EXPECT_FALSE(byIdentifier("r.added")->onSystemVolume);
 
     open();  // nothing changed
@@ -313,6 +335,14 @@ TEST_F(AppCatalogTest, RestartKeepsIdentityAndReadsOnlyWhatChanged) {
     EXPECT_EQ(byIdentifier("r.changed")->extensionPoint, "p2");
     EXPECT_TRUE(byIdentifier("r.entitled")->entitlements);
     EXPECT_TRUE(byIdentifier("r.added")->onSystemVolume);
+
+    // Another language renames without re-registering.
+    auto german = moved;
+    german.language = "de";
+    open(german);
+    EXPECT_EQ(byIdentifier("r.same")->localizedShortName, "Gleich");
+    EXPECT_EQ(byIdentifier("r.same")->uuid, same->uuid);
+    EXPECT_TRUE(recorder->installed().empty());
 }
 
 TEST_F(AppCatalogTest, WatchedFoldersShowInstallsUpdatesAndRemovals) {
@@ -456,6 +486,113 @@ TEST_F(AppCatalogTest, SecondOpenerWaitsThenFails) {
     ASSERT_FALSE(second);
     EXPECT_EQ(second.error().code, EBUSY);
     EXPECT_TRUE(log.contains("locked by another process")) << log.text();
+}
+
+TEST(PlugInDeclarations, BothVocabulariesAndTheirFallbacks) {
+    Dict newAttributes{{"VTExtensionIdentifier", Value("n.id")}, {"VTExtensionPointName", Value("n.point")}};
+    Dict oldAttributes{{"ovaro.identifier", Value("o.id")}, {"ovaro.protocol", Value("o.point")}};
+    Dict ownPoint{{"VTExtensionAttributes", Value(Dict{{"VTExtensionPointName", Value("own")}})}};
+    Dict oldOwnPoint{{"Attributes", Value(Dict{{"ovaro.protocol", Value("own")}})}};
+    auto info = [](const char* top, Dict topDictionary) {
+        return Value(Dict{{"MRBundleIdentifier", Value("bundle.id")}, {top, Value(std::move(topDictionary))}});
+    };
+    struct Case {
+        const char* name;
+        Value info;
+        std::vector<std::pair<std::string, std::optional<std::string>>> expected;  // identifier, point
+    };
+    const Case cases[] = {
+        {"new style", info("VTExtension", {{"VTExtensionAttributes", Value(newAttributes)}}), {{"n.id", "n.point"}}},
+        {"old style", info("Quamber", {{"Attributes", Value(oldAttributes)}}), {{"o.id", "o.point"}}},
+        {"old keys in a new top are not read", info("VTExtension", {{"Attributes", Value(oldAttributes)}}),
+         {{"bundle.id", std::nullopt}}},
+        {"both: the new one wins",
+         Value(info("Quamber", {{"Attributes", Value(oldAttributes)}})
+                   .asDictionary()
+                   ->changing("VTExtension", Value(Dict{{"VTExtensionAttributes", Value(newAttributes)}}))),
+         {{"n.id", "n.point"}}},
+        {"multiple, new style",
+         info("VTExtension", {{"VTExtensionAttributes", Value(newAttributes)},
+                              {"Multiple", Value(Dict{{"m.2", Value(ownPoint)}, {"m.1", Value(Dict{})}})}}),
+         {{"m.1", "n.point"}, {"m.2", "own"}}},
+        {"multiple, old style",
+         info("Quamber", {{"Attributes", Value(oldAttributes)}, {"Multiple", Value(Dict{{"m.1", Value(oldOwnPoint)}})}}),
+         {{"m.1", "own"}}},
+        {"multiple that is no dictionary", info("VTExtension", {{"Multiple", Value("x")}}), {{"bundle.id", std::nullopt}}},
+        {"top that is no dictionary", Value(Dict{{"MRBundleIdentifier", Value("b")}, {"VTExtension", Value(3)}}),
+         {{"b", std::nullopt}}},
+        {"nothing identifies it", Value(Dict{{"VTExtension", Value(Dict{})}}), {}},
+        {"no plug-in at all", Value(Dict{{"MRBundleIdentifier", Value("b")}}), {}},
+    };
+    for (const auto& c : cases) {
+        std::vector<std::pair<std::string, std::optional<std::string>>> got;
+        for (const auto& declared : qm::declaredPlugIns(c.info)) {
+            got.emplace_back(declared.identifier, declared.extensionPoint);
+        }
+        EXPECT_EQ(got, c.expected) << c.name;
+    }
+}
+
+TEST(DataContainer, NamedByTheBundleIdentifierForCodePlugInsOnly) {
+    qmtest::TempDir dir;
+    const std::string containers = dir.file("Containers");
+    struct Case {
+        std::optional<std::string> identifier;
+        bool executable;
+        bool made;
+    };
+    const Case cases[] = {
+        {"com.ok", true, true},   {"com.ok", false, false}, {"", true, false},
+        {"a/b", true, false},     {".hidden", true, false}, {"..", true, false},
+        {std::nullopt, true, false},
+    };
+    for (const auto& c : cases) {
+        Dict info;
+        if (c.identifier) {
+            info.set("MRBundleIdentifier", Value(*c.identifier));
+        }
+        if (c.executable) {
+            info.set("MRBundleExecutable", Value("run"));
+        }
+        LogCapture log;
+        auto container = qm::makeDataContainer(containers, Value(info), "/b");
+        EXPECT_EQ(container.has_value(), c.made) << c.identifier.value_or("(none)");
+        EXPECT_EQ(log.lines().size(), c.made || !c.executable ? 0u : 1u) << log.text();
+        if (container) {
+            EXPECT_TRUE(fs::is_directory(*container + "/tmp"));
+        }
+    }
+}
+
+TEST_F(AppCatalogTest, BundlesThatCannotBeStoredAreRefusedAlone) {
+    // A date past what a property list can write: readable, not storable.
+    std::string odd = base + "/elsewhere/Odd.bundle";
+    qmtest::writeFile(odd + "/Info.plist",
+                      "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict>"
+                      "<key>MRBundleIdentifier</key><string>odd</string><key>VTExtension</key><dict/>"
+                      "<key>When</key><date>2150-01-01T00:00:00Z</date></dict></plist>");
+    fs::create_directories(userRoot + "/S.app/PlugIns");
+    fs::copy(odd, userRoot + "/S.app/PlugIns/Odd.bundle", fs::copy_options::recursive);
+    writeBundle(userRoot + "/S.app/PlugIns/Fine.bundle", plugInInfo("fine", "p"));
+    open();
+    EXPECT_EQ(recorder->installedIdentifiers(), std::set<std::string>{"fine"});
+    auto error = catalog->registerPlugIn(odd);
+    ASSERT_TRUE(error);
+    EXPECT_EQ(qm::appCatalogErrorOf(*error), qm::AppCatalogError::notAPlugIn);
+    EXPECT_NE(error->text().find("cannot be stored"), std::string::npos) << error->text();
+}
+
+TEST_F(AppCatalogTest, UntrustedEntitlementsAreLoggedOncePerRegistration) {
+    std::string bundle = writeBundle(userRoot + "/T.app/PlugIns/T.bundle", plugInInfo("t", "p"));
+    writePlist(bundle + "/Entitlements.plist", Value(Dict{{"e", Value(true)}}));
+    ASSERT_EQ(::chmod((bundle + "/Entitlements.plist").c_str(), 0666), 0);
+    LogCapture log;
+    open();
+    EXPECT_FALSE(byIdentifier("t")->entitlements);
+    EXPECT_EQ(log.countContaining("entitlements not honoured"), 1u) << log.text();
+    open();
+    ASSERT_FALSE(catalog->registerPlugIn(bundle));
+    EXPECT_EQ(log.countContaining("entitlements not honoured"), 1u) << log.text();
 }
 
 }  // namespace

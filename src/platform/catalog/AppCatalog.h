@@ -18,6 +18,13 @@
 // needs is stored in an SQLite file, so unchanged bundles are not read again
 // at start; differences found at start are reported like any other.
 //
+// Folder events (inotify) on the roots, the applications (and Contents/),
+// their plug-ins folders, the folders of bundles registered by path and
+// bundles whose Info does not parse yet are coalesced (100 ms) and
+// re-checked with stat; lost events mean a full rescan. An Info file
+// rewritten inside a registered bundle, with no event in a watched folder,
+// is seen at the next start.
+//
 // Threads. The catalog has its own thread (a serial queue) on which every
 // change is made, committed and reported to observers, plus a reader of
 // folder events. Reads never go through that thread: they take the last

@@ -55,16 +55,6 @@ PlugInRecordPtr CatalogIndex::plugInAtPath(const std::string& bundlePath) const 
     return found == byPath_.end() ? nullptr : all_[found->second.first];
 }
 
-std::vector<PlugInRecordPtr> CatalogIndex::plugInsAtPath(const std::string& bundlePath) const {
-    auto found = byPath_.find(bundlePath);
-    if (found == byPath_.end()) {
-        return {};
-    }
-    auto first = all_.begin() + static_cast<std::ptrdiff_t>(found->second.first);
-    auto last = all_.begin() + static_cast<std::ptrdiff_t>(found->second.second);
-    return {first, last};
-}
-
 ApplicationRecordPtr CatalogIndex::applicationAtPath(const std::string& applicationPath) const {
     auto found = applications_.find(applicationPath);
     return found == applications_.end() ? nullptr : found->second;

@@ -29,7 +29,6 @@ public:
     PlugInRecordPtr plugInWithUuid(const Uuid& uuid) const;
     // The first plug-in of the bundle at the (resolved) path, in order.
     PlugInRecordPtr plugInAtPath(const std::string& bundlePath) const;
-    std::vector<PlugInRecordPtr> plugInsAtPath(const std::string& bundlePath) const;
     ApplicationRecordPtr applicationAtPath(const std::string& applicationPath) const;
     // Every plug-in, in path, identifier, UUID order.
     const std::vector<PlugInRecordPtr>& all() const { return all_; }

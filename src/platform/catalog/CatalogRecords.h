@@ -60,10 +60,12 @@ struct ApplicationRecord {
 using ApplicationRecordPtr = std::shared_ptr<const ApplicationRecord>;
 
 // Told of every change of the set of registered plug-ins, on the catalog's
-// own thread, one call at a time, after the change is committed and visible
-// to lookups. Within one change, pluginsWillUninstall comes first. An
-// observer may read the catalog; it must not call registerPlugIn or
-// unregisterPlugIn (they wait for the thread that is calling it).
+// own thread, one call at a time, after the change is committed and
+// published: lookups already answer for the installed records and no longer
+// for the uninstalled ones. Within one change, pluginsWillUninstall comes
+// first. Records are in path, identifier, UUID order. An observer may read
+// the catalog; it must not call registerPlugIn or unregisterPlugIn (they
+// wait for the thread that is calling it).
 class AppCatalogObserver {
 public:
     virtual ~AppCatalogObserver() = default;
