@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
+#include <map>
 #include <set>
 #include <thread>
 
@@ -190,6 +191,53 @@ TEST_F(Discovery, ApplicationsInstalledAndRemovedWhileRunningAreSeen) {
     EXPECT_EQ(identifiers(match(rules)), std::vector<std::string>{"ovaro.example.notes.widget"});
     EXPECT_EQ(*form(match({}), "ovaro.example.studio.blur")->get("uuid")->asString(), uuidBefore)
         << "an untouched application keeps its plug-ins' UUIDs";
+}
+
+// A second application carries ShareToNotes again, one version up, and a
+// plug-in that replaces it.
+TEST_F(Discovery, DuplicatesResolveByVersionAndReplacementsAreMarked) {
+    std::string copy = roots.file("Copy.app");
+    fs::copy(roots.file("system/Notes.app"), copy, fs::copy_options::recursive);
+    auto setVersion = [](const std::string& info, const char* version) {
+        auto dictionary = qm::plist::readFile(info);
+        ASSERT_TRUE(dictionary);
+        ASSERT_FALSE(qm::plist::writeFileAtomically(
+            info, Value(dictionary->asDictionary()->changing("MRBundleVersion", Value(version))), qm::plist::Format::xml));
+    };
+    setVersion(copy + "/PlugIns/ShareToNotes.bundle/Info.plist", "3.10");
+    std::string replacing = copy + "/PlugIns/Spelling.bundle";
+    qmtest::writeFile(replacing + "/Entitlements.plist",
+                      R"(<plist version="1.0"><dict><key>ovaro.developer.replace-plugin</key>)"
+                      R"(<string>ovaro.example.notes.share</string></dict></plist>)");
+    fs::rename(copy, roots.file("system/Copy.app"));
+
+    Dictionary shares{{"VTExtensionIdentifier", Value("ovaro.example.notes.share")}};
+    auto versionsOf = [&](std::uint64_t flags) {
+        std::multiset<std::string> versions;
+        Value reply = match(shares, flags);
+        for (const Value& found : *reply.get("matches")->packedContent()->asArray()) {
+            versions.insert(*found.get("version")->asString());
+        }
+        return versions;
+    };
+    for (int i = 0; i < 500 && versionsOf(0x1).size() < 2; ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    EXPECT_EQ(versionsOf(0), (std::multiset<std::string>{"3.10"})) << "3.10 is newer than 3.1";
+    EXPECT_EQ(versionsOf(0x1), (std::multiset<std::string>{"3.1", "3.10"}));
+
+    Value both = match({{"VTExtensionIdentifier", Value(Array{Value("ovaro.example.notes.share"), Value("ovaro.example.notes.spelling")})}});
+    const Value* replacer = nullptr;
+    for (const Value& found : *both.get("matches")->packedContent()->asArray()) {
+        if (*found.get("path")->asString() == roots.file("system/Copy.app/PlugIns/Spelling.bundle")) {
+            replacer = &found;
+        }
+    }
+    ASSERT_TRUE(replacer) << both.description();
+    EXPECT_EQ(*replacer->get("overriding"), Value("ovaro.example.notes.share"));
+    const Value* replaced = form(both, "ovaro.example.notes.share");
+    ASSERT_TRUE(replaced);
+    EXPECT_EQ(*replaced->get("overrider"), *replacer->get("uuid"));
 }
 
 TEST_F(Discovery, TheUsersExclusionsAreReadAgainWhenTheyChange) {
