@@ -129,7 +129,7 @@ void Discovery::visit(const QMDPlugInPtr& plugIn, const qm::Dictionary* rules, c
             return;
         }
     }
-    qm::Dictionary form = plugIn->exportForm();
+    qm::Dictionary form = plugIn->form();
     if (!resolveDuplicates(*plugIn, form)) {
         return;
     }

@@ -61,6 +61,11 @@ void QMDPlugIn::logBuildFailure(const std::string& bundlePath, const BuildFailur
     }
 }
 
+const qm::Dictionary& QMDPlugIn::form() const {
+    std::call_once(formOnce_, [this] { form_ = exportForm(); });
+    return form_;
+}
+
 std::optional<std::string> QMDPlugIn::localizedName() const {
     return record_->localizedName;
 }

@@ -9,6 +9,7 @@
 // keeps its record even while the catalog reports its uninstallation.
 
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -57,9 +58,15 @@ public:
     // container (code 12).
     qm::MaybeError diagnose() const override;
 
+    // The plug-in form, made once: nothing it holds changes after the record
+    // is built (replies add the annotations to their own copy).
+    const qm::Dictionary& form() const;
+
     // Use initWithACData.
     explicit QMDPlugIn(qm::PlugInRecordPtr record) : record_(std::move(record)) {}
 
 private:
     const qm::PlugInRecordPtr record_;
+    mutable std::once_flag formOnce_;
+    mutable qm::Dictionary form_;
 };
