@@ -12,13 +12,7 @@
 
 namespace {
 
-std::optional<std::string> stringAt(const qm::Value& dictionary, std::string_view key) {
-    const qm::Value* value = dictionary.get(key);
-    if (value == nullptr || !value->isString()) {
-        return std::nullopt;
-    }
-    return *value->asString();
-}
+using qm::stringAt;
 
 // The catalog reads the configuration before any normalization: the top
 // dictionary is "VTExtension", else the old style's "Quamber".

@@ -29,13 +29,7 @@ constexpr const char* kHash = "hash";
 constexpr const char* kRequirement = "requirement";
 }  // namespace formkey
 
-std::optional<std::string> stringAt(const qm::Value& form, std::string_view key) {
-    const qm::Value* value = form.get(key);
-    if (value == nullptr || !value->isString()) {
-        return std::nullopt;
-    }
-    return *value->asString();
-}
+using qm::stringAt;
 
 void setIfPresent(qm::Dictionary& form, const char* key, const std::optional<std::string>& value) {
     if (value) {

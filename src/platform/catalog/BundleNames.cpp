@@ -12,12 +12,6 @@ namespace {
 constexpr const char* kDisplayNameKey = "MRBundleDisplayName";
 constexpr const char* kNameKey = "MRBundleName";
 
-std::optional<std::string> stringAt(const Value& dictionary, const char* key) {
-    const Value* value = dictionary.get(key);
-    const std::string* text = value ? value->asString() : nullptr;
-    return text ? std::optional<std::string>(*text) : std::nullopt;
-}
-
 // The strings dictionary for the language; null when there is none.
 Value localizedStrings(const std::string& infoFolder, const std::optional<std::string>& language) {
     if (!language || language->find('/') != std::string::npos) {

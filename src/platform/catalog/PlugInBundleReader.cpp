@@ -21,12 +21,6 @@ namespace {
 constexpr const char* kInfoFileName = "Info.plist";
 constexpr const char* kEntitlementsFileName = "Entitlements.plist";
 
-std::optional<std::string> stringAt(const Value& dictionary, const char* key) {
-    const Value* value = dictionary.get(key);
-    const std::string* text = value ? value->asString() : nullptr;
-    return text ? std::optional<std::string>(*text) : std::nullopt;
-}
-
 bool isContainerName(const std::string& name) {
     return !name.empty() && name.find('/') == std::string::npos && name.front() != '.';
 }

@@ -17,12 +17,6 @@ constexpr const char* kOldTopKey = "Quamber";
 constexpr const char* kMultipleKey = "Multiple";
 constexpr const char* kBundleIdentifierKey = "MRBundleIdentifier";
 
-std::optional<std::string> stringAt(const Value* dictionary, const char* key) {
-    const Value* value = dictionary ? dictionary->get(key) : nullptr;
-    const std::string* text = value ? value->asString() : nullptr;
-    return text ? std::optional<std::string>(*text) : std::nullopt;
-}
-
 const Value* attributesOf(const Value& dictionary, const Vocabulary& words) {
     return dictionary.get(words.attributes);
 }

@@ -420,4 +420,14 @@ bool Dictionary::operator==(const Dictionary& other) const noexcept {
     return entries_ == other.entries_;
 }
 
+std::optional<std::string> stringAt(const Value& dictionary, std::string_view key) {
+    return stringAt(&dictionary, key);
+}
+
+std::optional<std::string> stringAt(const Value* dictionary, std::string_view key) {
+    const Value* value = dictionary ? dictionary->get(key) : nullptr;
+    const std::string* text = value ? value->asString() : nullptr;
+    return text ? std::optional<std::string>(*text) : std::nullopt;
+}
+
 }  // namespace qm

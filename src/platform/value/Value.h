@@ -154,4 +154,9 @@ private:
     std::vector<Entry> entries_;
 };
 
+// The string under key in a dictionary; nothing when the dictionary (null
+// included) has no such key or its value is not a string.
+std::optional<std::string> stringAt(const Value& dictionary, std::string_view key);
+std::optional<std::string> stringAt(const Value* dictionary, std::string_view key);
+
 }  // namespace qm
