@@ -115,4 +115,17 @@ TEST_F(InProcessServer, ALongHandlerNeitherDelaysAcceptsNorHangUpsNorServesTheDe
     EXPECT_TRUE(live.roundTrip(qmtest::bulk()));
 }
 
+TEST_F(InProcessServer, UnexpectedMessagesAreLoggedTenTimesThenCounted) {
+    start(/*scanned=*/true);
+    {
+        qmtest::FramePeer client(socketPath);
+        for (int i = 0; i < 12; ++i) {
+            client.send(qm::Value(qm::Array{}));
+        }
+        EXPECT_TRUE(client.roundTrip(qmtest::bulk())) << "the connection stays open";
+    }
+    EXPECT_TRUE(log.waitFor("sent 12 unexpected messages, 2 of them not logged"));
+    EXPECT_EQ(log.countContaining("unexpected message ()"), 10u) << log.text();
+}
+
 }  // namespace

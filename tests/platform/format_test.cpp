@@ -37,4 +37,24 @@ TEST(Format, NullCStringsAndMissingArgumentsPrintAsNull) {
     EXPECT_EQ(format("100%% sure %"), "100% sure %");
 }
 
+TEST(Format, LogLinesBoundWhatAPeerMakesThemCarry) {
+    std::string huge(3000, 'x');
+    huge.replace(1023, 2, "é");  // a character across the cut stays whole
+    std::string line = qm::boundedFormat("request %@ from %d", huge, 7);
+    EXPECT_EQ(line, "request " + huge.substr(0, 1023) + "…[3000 bytes] from 7");
+    EXPECT_EQ(qm::boundedFormat("%@", std::string("short")), "short");
+
+    auto lines = qm::splitForLog(huge);
+    ASSERT_EQ(lines.size(), 3u);
+    std::string joined = lines[0];
+    for (std::size_t i = 0; i < lines.size(); ++i) {
+        EXPECT_LE(lines[i].size(), qm::kMaxLoggedArgument);
+        if (i > 0) {
+            ASSERT_EQ(lines[i].rfind("… ", 0), 0u) << "a continuation says so";
+            joined += lines[i].substr(std::string("… ").size());
+        }
+    }
+    EXPECT_EQ(joined, huge) << "nothing is lost between the pieces";
+}
+
 }  // namespace
