@@ -6,6 +6,8 @@
 
 #include "model/QMError.h"
 #include "platform/bundle/BundleDirectory.h"
+#include "platform/catalog/BundleLayout.h"
+#include "platform/catalog/PlugInDeclarations.h"
 #include "platform/env/Environment.h"
 #include "platform/file/PathFacts.h"
 #include "platform/plist/PropertyList.h"
@@ -50,19 +52,6 @@ std::int32_t clampedSeconds(std::int64_t seconds) {
 // A bundle identifier names a folder of its own under Containers/.
 bool isContainerName(const std::string& name) {
     return !name.empty() && name != "." && name != ".." && name.find('/') == std::string::npos;
-}
-
-std::string parentOf(const std::string& path) {
-    std::size_t slash = path.find_last_of('/');
-    if (slash == std::string::npos || slash == 0) {
-        return slash == 0 ? "/" : "";
-    }
-    return path.substr(0, slash);
-}
-
-std::string lastComponentOf(const std::string& path) {
-    std::size_t slash = path.find_last_of('/');
-    return slash == std::string::npos ? path : path.substr(slash + 1);
 }
 
 }  // namespace
@@ -155,45 +144,15 @@ qm::Result<std::vector<OfflinePlugIn>> OfflinePlugIns::inspectBundle(
 }
 
 std::vector<std::string> OfflinePlugIns::declaredIdentifiers(const qm::Value& infoDictionary) {
-    const DeclaredTop declared = declaredTop(infoDictionary);
-    if (const qm::Value* multiple = declared.top.get(qmkey::kMultiple)) {
-        if (const qm::Dictionary* entries = multiple->asDictionary()) {
-            std::vector<std::string> identifiers;
-            for (const auto& entry : *entries) {
-                identifiers.push_back(entry.first);
-            }
-            return identifiers;
-        }
+    std::vector<std::string> identifiers;
+    for (const qm::DeclaredPlugIn& plugIn : qm::declaredPlugIns(infoDictionary)) {
+        identifiers.push_back(plugIn.identifier);
     }
-    const char* attributesKey = declared.oldStyle ? "Attributes" : qmkey::kAttributes;
-    const char* identifierKey = declared.oldStyle ? "ovaro.identifier" : qmkey::kExtensionIdentifier;
-    if (const qm::Value* attributes = declared.top.get(attributesKey)) {
-        if (auto identifier = stringAt(*attributes, identifierKey)) {
-            return {*identifier};
-        }
-    }
-    if (auto identifier = stringAt(infoDictionary, qmkey::kBundleIdentifier)) {
-        return {*identifier};
-    }
-    return {};
+    return identifiers;
 }
 
 std::optional<std::string> OfflinePlugIns::containingApplicationPath(const std::string& bundlePath) {
-    std::string plugInsDirectory = parentOf(bundlePath);
-    if (lastComponentOf(plugInsDirectory) != "PlugIns") {
-        return std::nullopt;
-    }
-    std::string support = parentOf(plugInsDirectory);
-    if (lastComponentOf(support) == "Contents") {
-        std::string application = parentOf(support);
-        if (application.ends_with(".app")) {
-            return application;
-        }
-    }
-    if (support.ends_with(".app")) {
-        return support;
-    }
-    return std::nullopt;
+    return qm::containingApplicationPath(bundlePath);
 }
 
 bool OfflinePlugIns::isOnSystemVolume(const std::string& bundlePath) {
@@ -201,13 +160,13 @@ bool OfflinePlugIns::isOnSystemVolume(const std::string& bundlePath) {
     if (!resolved.ok()) {
         return false;
     }
+    std::vector<std::string> roots;
     for (const std::string& root : qm::systemRoots()) {
-        auto resolvedRoot = qm::resolvedPath(root);
-        if (resolvedRoot.ok() && qm::isPathWithin(*resolved, *resolvedRoot)) {
-            return true;
+        if (auto resolvedRoot = qm::resolvedPath(root); resolvedRoot.ok()) {
+            roots.push_back(*resolvedRoot);
         }
     }
-    return false;
+    return qm::isUnderAnyRoot(*resolved, roots);
 }
 
 std::uint32_t OfflinePlugIns::hubProtocolVersionOf(const QMPlugInCore& plugIn) {
