@@ -1,6 +1,6 @@
 # The two commands of the README: `make run` and `make test`.
 # Build folders: build/ (plain), build-asan/ (AddressSanitizer + UBSan),
-# build-tsan/ (ThreadSanitizer, for the queue and transport tests).
+# build-tsan/ (ThreadSanitizer, for the queue, transport and hold-list tests).
 
 JOBS ?= $(shell nproc)
 CMAKE_FLAGS ?=
@@ -40,7 +40,7 @@ test-asan: deps
 test-tsan: deps
 	@cmake -S . -B build-tsan -DQM_SANITIZE=thread $(CMAKE_FLAGS) >/dev/null
 	cmake --build build-tsan -j $(JOBS) --target concurrency_tests
-	cd build-tsan && ctest --output-on-failure -j $(JOBS) -L 'queue|transport'
+	cd build-tsan && ctest --output-on-failure -j $(JOBS) -L 'queue|transport|hold_list'
 
 bench: build
 	build/bench/qmd_bench

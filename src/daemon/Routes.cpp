@@ -2,6 +2,7 @@
 
 #include "discovery/MatchRequest.h"
 #include "registry/AnnotateRequest.h"
+#include "registry/HoldsRequest.h"
 #include "registry/RegistrationRequests.h"
 
 namespace {
@@ -16,6 +17,8 @@ constexpr Route kRoutes[] = {
     {"access", nullptr, false},
     {"annotate", &annotatePlugIns, false},
     {"lock", nullptr, false},
+    // Beyond the design: answered only to clients that are not sandboxed.
+    {"holds", &listHolds, false},
 };
 
 }  // namespace

@@ -107,11 +107,12 @@ TEST(SerialQueue, NestingsTheLockOrderAllowsNeverDeadlock) {
         Queues queues;
         std::promise<void> finished;
         auto ran = finished.get_future();
-        std::thread([&] { nesting.run(queues, [&] { finished.set_value(); }); }).detach();
+        std::thread runner([&] { nesting.run(queues, [&] { finished.set_value(); }); });
         if (ran.wait_for(std::chrono::seconds(10)) != std::future_status::ready) {
             std::fprintf(stderr, "deadlock: %s\n", nesting.name);
             std::_Exit(1);
         }
+        runner.join();  // it may still be leaving a queue it ran on
         queues.x.sync([] {});
         queues.y.sync([] {});
         queues.z.sync([] {});
