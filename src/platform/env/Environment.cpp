@@ -172,6 +172,10 @@ std::string dataContainersDirectory() {
     return xdgDataHome() + "/ovaro/Containers";
 }
 
+std::string consentStorePath() {
+    return xdgDataHome() + "/ovaro/Consent.plist";
+}
+
 std::optional<std::string> userLanguage() {
     for (const char* name : {"LANGUAGE", "LC_ALL", "LC_MESSAGES", "LANG"}) {
         auto v = variable(name);

@@ -57,6 +57,9 @@ std::string userApplicationsRoot();
 // The folder of plug-in data containers: $XDG_DATA_HOME/ovaro/Containers.
 std::string dataContainersDirectory();
 
+// The user's consent grants: $XDG_DATA_HOME/ovaro/Consent.plist.
+std::string consentStorePath();
+
 // The user's language: the first of LANGUAGE, LC_ALL, LC_MESSAGES, LANG that
 // is set and not empty, cut before "_", "." or "@" (and before ":" for
 // LANGUAGE lists); nothing when none is set.
