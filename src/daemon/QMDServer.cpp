@@ -75,8 +75,10 @@ QMDServer::QMDServer(std::unique_ptr<qm::EventLoop> loop, std::unique_ptr<QMData
 }
 
 void QMDServer::run() {
-    // Counts restart with the daemon (a failure was logged by the poster).
+    // Counts restart with the daemon (a failure was logged by the poster);
+    // registrations of hosts that exited meanwhile go.
     (void)notifications_.reset();
+    qm::removeExitedHostRegistrations(qm::ductRuntimeDirectory());
     registry_->whenReady([this] { loop_->post([this] { resumeListener(); }); });
     loop_->run();
 }

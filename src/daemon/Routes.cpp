@@ -1,5 +1,6 @@
 #include "daemon/Routes.h"
 
+#include "access/LockRequest.h"
 #include "discovery/MatchRequest.h"
 #include "registry/AnnotateRequest.h"
 #include "registry/HoldsRequest.h"
@@ -16,7 +17,7 @@ constexpr Route kRoutes[] = {
     {"ready", nullptr, false},
     {"access", nullptr, false},
     {"annotate", &annotatePlugIns, false},
-    {"lock", nullptr, false},
+    {"lock", &lockDownPlugIns, false},
     // Beyond the design: answered only to clients that are not sandboxed.
     {"holds", &listHolds, false},
 };

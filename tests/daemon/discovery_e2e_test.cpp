@@ -4,6 +4,10 @@
 
 #include <gtest/gtest.h>
 
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
 #include <filesystem>
 #include <map>
 #include <set>
@@ -250,6 +254,78 @@ TEST_F(Discovery, TheUsersExclusionsAreReadAgainWhenTheyChange) {
     ASSERT_FALSE(qm::plist::writeFileAtomically(prefs, exclusions, qm::plist::Format::binary));
     EXPECT_TRUE(identifiers(match(rules)).empty());
     EXPECT_TRUE(qmd->waitForLog("plugin ovaro.example.notes.share excluded"));
+}
+
+TEST_F(Discovery, AHoldHidesItsPlugInsUntilReleasedOrItsClientDies) {
+    std::string share = roots.file("system/Notes.app/PlugIns/ShareToNotes.bundle");
+    Dictionary rules{{"VTExtensionPointName", Value("ovaro.share-services")}};
+    auto lock = [&](qmtest::FramePeer& peer, std::uint64_t flags, Array paths) {
+        auto reply = peer.roundTrip(qmtest::request({{"request", Value("lock")}, {"version", Value(std::uint64_t{3})},
+                                                     {"flags", Value(flags)}, {"paths", Value(std::move(paths))}}));
+        return reply.value_or(Value());
+    };
+    EXPECT_EQ(errorText(lock(*client, 3, Array{Value(share)})), "invalid request format (unsupported hold flags)");
+    EXPECT_TRUE(lock(*client, 3, Array{}).get("uuids")) << "no path: an empty hold";
+    EXPECT_EQ(errorText(lock(*client, 2, Array{Value(roots.file("system/Notes.app"))})),
+              "no plug-in at path:" + roots.file("system/Notes.app"));
+
+    Value granted = lock(*client, 2, Array{Value(share)});
+    ASSERT_TRUE(granted.get("uuids") && granted.get("uuids")->asUuid()) << granted.description();
+    Value token = *granted.get("uuids");
+    EXPECT_TRUE(identifiers(match(rules)).empty());
+    EXPECT_EQ(identifiers(match(rules, 0, true), "explanations"), std::vector<std::string>{"ovaro.example.notes.share"});
+    Value holds = send({{"request", Value("holds")}});
+    ASSERT_EQ(holds.get("holds")->asArray()->size(), 2u) << holds.description();
+    EXPECT_EQ(*(*holds.get("holds")->asArray())[1].get("uuid"), token);
+    EXPECT_EQ(*(*holds.get("holds")->asArray())[1].get("pid"), Value(static_cast<std::int64_t>(::getpid())));
+
+    // Any client may release by token; a second release changes nothing.
+    qmtest::FramePeer other(qmd->socketPath());
+    for (int i = 0; i < 2; ++i) {
+        EXPECT_EQ(other.roundTrip(qmtest::request({{"request", Value("lock")}, {"version", Value(std::uint64_t{3})},
+                                                   {"uuids", Value(Array{token})}})),
+                  Value(Dictionary{}));
+    }
+    EXPECT_EQ(identifiers(match(rules)), std::vector<std::string>{"ovaro.example.notes.share"});
+
+    // A holder that dies leaves no hold behind.
+    {
+        qmtest::FramePeer installer(qmd->socketPath());
+        ASSERT_TRUE(lock(installer, 1, Array{Value(roots.file("system/Notes.app"))}).get("uuids"));
+        EXPECT_TRUE(identifiers(match(rules)).empty());
+    }
+    EXPECT_TRUE(qmd->waitForLog("for dead client pid"));
+    EXPECT_EQ(identifiers(match(rules)), std::vector<std::string>{"ovaro.example.notes.share"});
+}
+
+TEST_F(Discovery, AnApplicationWithABusyPlugInCannotBeHeld) {
+    std::string bundle = roots.file("system/Notes.app/PlugIns/ShareToNotes.bundle");
+    fs::copy_file("/bin/sleep", bundle + "/ShareToNotes", fs::copy_options::overwrite_existing);
+    pid_t running = ::fork();
+    if (running == 0) {
+        std::string executable = bundle + "/ShareToNotes";
+        ::execl(executable.c_str(), executable.c_str(), "30", static_cast<char*>(nullptr));
+        ::_exit(127);
+    }
+    Value refused;
+    for (int i = 0; i < 100 && !errorCode(refused); ++i) {  // until the process runs its executable
+        refused = send({{"request", Value("lock")}, {"flags", Value(std::uint64_t{1})},
+                        {"paths", Value(Array{Value(roots.file("system/Notes.app"))})}});
+        if (!errorCode(refused)) {
+            send({{"request", Value("lock")}, {"uuids", Value(Array{*refused.get("uuids")})}});
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        }
+    }
+    ::kill(running, SIGKILL);
+    ::waitpid(running, nullptr, 0);
+    EXPECT_EQ(errorCode(refused), 14u);
+    EXPECT_EQ(errorText(refused), "plug-ins are busy");
+    EXPECT_EQ(*refused.get("conflicts"),
+              Value(Array{Value(Dictionary{{"MRBundleIdentifier", Value("ovaro.example.notes.share")}})}));
+    EXPECT_TRUE(send({{"request", Value("lock")}, {"flags", Value(std::uint64_t{1})},
+                      {"paths", Value(Array{Value(roots.file("system/Notes.app"))})}})
+                    .get("uuids"))
+        << "an exited process is busy no more";
 }
 
 }  // namespace
