@@ -1,5 +1,6 @@
 #include "daemon/Routes.h"
 
+#include "access/AccessRequests.h"
 #include "access/LockRequest.h"
 #include "discovery/MatchRequest.h"
 #include "registry/AnnotateRequest.h"
@@ -14,8 +15,8 @@ constexpr Route kRoutes[] = {
     {"remove", &removePlugIns, false},
     {"bulk", &bulkPlugIns, true},
     {"match", &matchPlugIns, false},
-    {"ready", nullptr, false},
-    {"access", nullptr, false},
+    {"ready", &readyPlugIns, false},
+    {"access", &accessPlugIns, false},
     {"annotate", &annotatePlugIns, false},
     {"lock", &lockDownPlugIns, false},
     // Beyond the design: answered only to clients that are not sandboxed.

@@ -6,8 +6,10 @@
 #include <map>
 
 #include "discovery/HostChecks.h"
+#include "discovery/RecordFacts.h"
 #include "discovery/MatchRules.h"
 #include "discovery/QMDUserPrefs.h"
+#include "discovery/ResourceExtensions.h"
 #include "model/QMError.h"
 #include "model/ValueHelpers.h"
 #include "protocol/Packing.h"
@@ -20,21 +22,6 @@ namespace {
 
 constexpr const char* kManagerEntitlement = "ovaro.private.quamber.manager";
 constexpr const char* kReplacePlugIn = "ovaro.developer.replace-plugin";
-
-PlugInFacts factsOf(const QMDPlugIn& plugIn, QMDatabase& registry) {
-    PlugInFacts facts;
-    facts.identifier = plugIn.identifier();
-    facts.uuid = plugIn.uuid();
-    facts.attributes = plugIn.attributes();
-    facts.bundleInfoDictionary = plugIn.bundleInfoDictionary();
-    facts.entitlements = plugIn.entitlements().value_or(qm::Value());
-    facts.election = [&registry, &plugIn]() -> std::optional<qm::Value> {
-        auto annotation = registry.annotationForPlugIn(plugIn);
-        const qm::Value* election = annotation ? annotation->get("election") : nullptr;
-        return election ? std::optional<qm::Value>(*election) : std::nullopt;
-    };
-    return facts;
-}
 
 // One accepted plug-in: its form as the reply will carry it.
 struct Result {
@@ -134,6 +121,7 @@ void Discovery::visit(const QMDPlugInPtr& plugIn, const qm::Dictionary* rules, c
         return;
     }
     form.set("annotations", context_.registry.annotationForPlugIn(*plugIn).value_or(qm::Value(qm::Dictionary{})));
+    augmentForm(*plugIn, form);
     results_.push_back(Result{std::move(form), identifier, plugIn});
     auto accepted = std::prev(results_.end());
     auto replaced = plugIn->valueForEntitlement(kReplacePlugIn);

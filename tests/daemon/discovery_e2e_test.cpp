@@ -14,8 +14,10 @@
 #include <thread>
 
 #include "platform/plist/PropertyList.h"
+#include "platform/sandbox/ReadExtensions.h"
 #include "support/DaemonProcess.h"
 #include "support/FramePeer.h"
+#include "support/ScopedEnvironment.h"
 
 namespace {
 
@@ -326,6 +328,63 @@ TEST_F(Discovery, AnApplicationWithABusyPlugInCannotBeHeld) {
                       {"paths", Value(Array{Value(roots.file("system/Notes.app"))})}})
                     .get("uuids"))
         << "an exited process is busy no more";
+}
+
+TEST_F(Discovery, HostsGetTokensForBundlesAndSharedResourcesAndLaunchRegistrations) {
+    std::string share = roots.file("system/Notes.app/PlugIns/ShareToNotes.bundle");
+    // A shared path that leaves its bundle through a link gets no token.
+    fs::remove_all(share + "/Help");
+    fs::create_directory_symlink(roots.file("system"), share + "/Help");
+    Value found = match({{"VTExtensionPointName", Value("ovaro.share-services")}});
+    const Value* form = this->form(found, "ovaro.example.notes.share");
+    ASSERT_TRUE(form);
+    const Value* extensions = form->get("extensions");
+    ASSERT_TRUE(extensions && extensions->isDictionary()) << form->description();
+    EXPECT_TRUE(extensions->get("Resources"));
+    EXPECT_FALSE(extensions->get("Help")) << "a link out of the bundle";
+    EXPECT_FALSE(extensions->get("Templates")) << "no such resource";
+    EXPECT_TRUE(qmd->waitForLog("failed to make extension for " + share + "/Help"));
+
+    Value shareUuid(*qm::Uuid::parse(*form->get("uuid")->asString()));
+    Value spelling = match({{"VTExtensionIdentifier", Value("ovaro.example.notes.spelling")}});
+    Value spellingUuid(*qm::Uuid::parse(*this->form(spelling, "ovaro.example.notes.spelling")->get("uuid")->asString()));
+
+    qmtest::ScopedEnvironment duct("QM_DUCT_DIR", qmd->runtimeDirectory());
+    Value access = send({{"request", Value("access")}, {"uuids", Value(Array{spellingUuid, shareUuid})}});
+    const qm::Array* tokens = access.get("extensions") ? access.get("extensions")->asArray() : nullptr;
+    ASSERT_TRUE(tokens && tokens->size() == 2) << access.description();
+    auto named = qm::verifyExtension(*(*tokens)[1].asString());
+    ASSERT_TRUE(named) << named.error().text();
+    EXPECT_EQ(named->path, fs::canonical(share).string());
+    std::string forged = *(*tokens)[1].asString();
+    forged[5] = forged[5] == 'a' ? 'b' : 'a';
+    EXPECT_FALSE(qm::verifyExtension(forged));
+
+    EXPECT_EQ(send({{"request", Value("ready")}, {"uuids", Value(Array{spellingUuid, shareUuid, shareUuid})}}),
+              Value(Dictionary{}));
+    std::string services = qmd->runtimeDirectory() + "/services/" + std::to_string(::getpid());
+    auto registration = qm::plist::readFile(services + "/ovaro.example.notes.share.plist");
+    ASSERT_TRUE(registration) << registration.error().text();
+    std::string container = qmd->scratchPath("data/ovaro/Containers/ovaro.example.notes.share");
+    Value expected(Dictionary{
+        {"DuctService", Value(Dictionary{{"EnvironmentVariables", Value(Dictionary{{"HOME", Value(container)},
+                                                                                   {"MRFIXED_USER_HOME", Value(container)},
+                                                                                   {"TMPDIR", Value(container + "/tmp")}})},
+                                         {"_OmitSandboxParameters", Value(true)},
+                                         {"_SandboxProfile", Value("plugin")}})},
+        {"ExecutablePath", Value(fs::canonical(share).string() + "/ShareToNotes")},
+        {"MRBundleIdentifier", Value("ovaro.example.notes.share")},
+        {"MRBundlePackageType", Value("DCT!")},
+        {"MRBundleVersion", Value("3.1")}});
+    EXPECT_EQ(*registration, expected);
+    EXPECT_FALSE(fs::exists(services + "/ovaro.example.notes.spelling.plist")) << "a data plug-in launches nothing";
+
+    Value hold = send({{"request", Value("lock")}, {"flags", Value(std::uint64_t{2})}, {"paths", Value(Array{Value(share)})}});
+    ASSERT_TRUE(hold.get("uuids"));
+    EXPECT_EQ(errorText(send({{"request", Value("ready")}, {"uuids", Value(Array{shareUuid})}})),
+              "access to plugin ovaro.example.notes.share denied: the plug-in is on hold");
+    EXPECT_EQ(send({{"request", Value("access")}, {"uuids", Value(Array{shareUuid})}}).get("extensions")->asArray()->size(), 1u)
+        << "tokens for a held plug-in all the same";
 }
 
 }  // namespace
