@@ -387,4 +387,53 @@ TEST_F(Discovery, HostsGetTokensForBundlesAndSharedResourcesAndLaunchRegistratio
         << "tokens for a held plug-in all the same";
 }
 
+TEST_F(Discovery, AKeyboardIsSandboxedUnlessItsApplicationWasGrantedTheNetwork) {
+    std::string app = roots.file("Keys.app");
+    qmtest::writeFile(app + "/Info.plist",
+                      R"(<plist version="1.0"><dict><key>MRBundleIdentifier</key><string>ovaro.example.keys</string></dict></plist>)");
+    qmtest::writeFile(app + "/PlugIns/Keyboard.bundle/Info.plist", R"(<plist version="1.0"><dict>
+        <key>MRBundleIdentifier</key><string>ovaro.example.keys.keyboard</string>
+        <key>MRBundleExecutable</key><string>Keyboard</string>
+        <key>VTExtension</key><dict>
+          <key>VTExtensionPointIdentifier</key><string>ovaro.keyboard-service</string>
+          <key>VTExtensionProtocol</key><string>KeyboardProtocol</string>
+          <key>VTExtensionAttributes</key><dict><key>VTExtensionPointName</key><string>ovaro.keyboard-service</string>
+            <key>RequestsOpenAccess</key><true/></dict></dict></dict></plist>)");
+    qmtest::writeFile(app + "/PlugIns/Keyboard.bundle/Keyboard", "#!/bin/sh\n");
+    fs::rename(app, roots.file("system/Keys.app"));
+    Dictionary rules{{"VTExtensionPointName", Value("ovaro.keyboard-service")}};
+    for (int i = 0; i < 500 && identifiers(match(rules)).empty(); ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    Value uuid(*qm::Uuid::parse(*form(match(rules), "ovaro.example.keys.keyboard")->get("uuid")->asString()));
+
+    struct Case {
+        const char* name;
+        std::optional<std::string> consent;  // none: no file
+        const char* profile;
+    };
+    const std::string granting = R"(<plist version="1.0"><dict><key>ovaro.example.keys</key><dict>)"
+                                 R"(<key>ovaro.pvc.keyboard-network</key><true/></dict></dict></plist>)";
+    const Case cases[] = {
+        {"no consent file", std::nullopt, "keyboard"},
+        {"granted", granting, "plugin"},
+        {"refused", R"(<plist version="1.0"><dict><key>ovaro.example.keys</key><dict>)"
+                    R"(<key>ovaro.pvc.keyboard-network</key><false/></dict></dict></plist>)", "keyboard"},
+        {"damaged", "<plist", "keyboard"},
+    };
+    std::string consentFile = qmd->scratchPath("data/ovaro/Consent.plist");
+    for (const Case& c : cases) {
+        fs::remove(consentFile);
+        if (c.consent) {
+            qmtest::writeFile(consentFile, *c.consent);
+        }
+        ASSERT_EQ(send({{"request", Value("ready")}, {"uuids", Value(Array{uuid})}}), Value(Dictionary{})) << c.name;
+        auto registration = qm::plist::readFile(qmd->runtimeDirectory() + "/services/" + std::to_string(::getpid()) +
+                                                "/ovaro.example.keys.keyboard.plist");
+        ASSERT_TRUE(registration) << c.name;
+        EXPECT_EQ(*registration->get("DuctService")->get("_SandboxProfile"), Value(c.profile)) << c.name;
+    }
+    EXPECT_TRUE(qmd->waitForLog("PVCAccessCopyInformationForBundle failed for"));
+}
+
 }  // namespace
