@@ -11,6 +11,7 @@
 
 #include "platform/duct/Frame.h"
 #include "support/DaemonProcess.h"
+#include "support/Eventually.h"
 #include "support/FramePeer.h"
 
 using qmtest::DaemonProcess;
@@ -20,13 +21,6 @@ using qmtest::errorCode;
 using qmtest::request;
 
 namespace {
-
-void expectServed(DaemonProcess& daemon) {
-    FramePeer other(daemon.socketPath());
-    auto reply = other.roundTrip(bulk());
-    ASSERT_TRUE(reply);
-    EXPECT_FALSE(errorCode(*reply).has_value());
-}
 
 // Each kind of broken frame is the transport's test; here one makes the
 // whole trip: its connection is closed and logged, the daemon serves on.
@@ -68,30 +62,21 @@ TEST(Connections, AFloodingClientThatNeverReadsDelaysNobodyElse) {
         }
     });
     for (int i = 0; i < 20; ++i) {
-        FramePeer polite(daemon.socketPath());
-        auto reply = polite.roundTrip(bulk(), std::chrono::seconds(10));
-        ASSERT_TRUE(reply) << "round " << i;
+        ASSERT_TRUE(FramePeer(daemon.socketPath()).roundTrip(bulk(), std::chrono::seconds(10))) << "round " << i;
     }
     // The flood goes on unread: its replies outgrow the backlog bound, and
     // the daemon cuts the flooder off rather than hold them.
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-    while (!cutOff.load() && std::chrono::steady_clock::now() < deadline) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    }
+    EXPECT_TRUE(qmtest::eventually([&] { return cutOff.load(); }, std::chrono::seconds(30)));
     stop = true;
     flood.join();
-    EXPECT_TRUE(cutOff.load());
     EXPECT_TRUE(daemon.waitForLog("reply backlog over 4 MiB"));
     ASSERT_TRUE(daemon.running());
-    expectServed(daemon);
+    EXPECT_TRUE(FramePeer(daemon.socketPath()).roundTrip(bulk()));
 }
 
 TEST(Connections, FiveHundredConcurrentClientsAreServedAndLeaveNoDescriptorBehind) {
     DaemonProcess daemon;
-    {
-        FramePeer warmUp(daemon.socketPath());
-        ASSERT_TRUE(warmUp.roundTrip(bulk()));
-    }
+    ASSERT_TRUE(FramePeer(daemon.socketPath()).roundTrip(bulk()));  // warms up
     std::this_thread::sleep_for(std::chrono::milliseconds(200));
     std::size_t before = daemon.openDescriptorCount();
     std::vector<std::unique_ptr<FramePeer>> clients;
@@ -109,11 +94,7 @@ TEST(Connections, FiveHundredConcurrentClientsAreServedAndLeaveNoDescriptorBehin
     }
     EXPECT_GE(daemon.openDescriptorCount(), before + 500);
     clients.clear();
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-    while (daemon.openDescriptorCount() != before && std::chrono::steady_clock::now() < deadline) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    }
-    EXPECT_EQ(daemon.openDescriptorCount(), before);
+    EXPECT_TRUE(qmtest::eventually([&] { return daemon.openDescriptorCount() == before; })) << daemon.openDescriptorCount();
 }
 
 }  // namespace

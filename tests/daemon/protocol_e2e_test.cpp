@@ -5,7 +5,6 @@
 #include "support/DaemonProcess.h"
 #include "support/FramePeer.h"
 
-using qmtest::DaemonOptions;
 using qmtest::DaemonProcess;
 using qmtest::FramePeer;
 using qmtest::bulk;
@@ -14,12 +13,6 @@ using qmtest::errorText;
 using qmtest::request;
 
 namespace {
-
-qm::Value roundTrip(FramePeer& client, const qm::Value& message) {
-    auto reply = client.roundTrip(message);
-    EXPECT_TRUE(reply.has_value()) << "no reply to " << message.description();
-    return reply.value_or(qm::Value());
-}
 
 // The envelope is checked in this order: the version, then the request's
 // name. Requests sent back to back are answered in their order, with their
@@ -87,10 +80,10 @@ TEST(Protocol, VerbosityChoosesWhatIsLogged) {
         bool fullRequests;
     };
     for (const Case& c : {Case{{}, false, false}, Case{{"-v"}, true, false}, Case{{"-v", "-v"}, true, true}}) {
-        DaemonProcess daemon(qmtest::withArguments(c.flags));
+        DaemonProcess daemon(c.flags);
         FramePeer client(daemon.socketPath());
-        roundTrip(client, bulk());
-        roundTrip(client, request({{"request", "nope"}, {"version", std::uint64_t{3}}}));
+        ASSERT_TRUE(client.roundTrip(bulk()));
+        ASSERT_TRUE(client.roundTrip(request({{"request", "nope"}, {"version", std::uint64_t{3}}})));
         ASSERT_TRUE(daemon.waitForLog("bulk options 0x0 not supported"));  // always written
         std::string pid = std::to_string(::getpid());
         EXPECT_EQ(daemon.waitForLog("client " + pid + " request bulk", std::chrono::milliseconds(300)), c.debugLines);
@@ -104,7 +97,7 @@ TEST(Protocol, VerbosityChoosesWhatIsLogged) {
 }
 
 TEST(Protocol, EveryThousandthRequestOfAClientIsCounted) {
-    DaemonProcess daemon(qmtest::withArguments({"-v"}));
+    DaemonProcess daemon({"-v"});
     FramePeer client(daemon.socketPath());
     std::string line = "client " + std::to_string(::getpid()) + " used ";
     for (int i = 1; i <= 2000; ++i) {

@@ -1,14 +1,13 @@
 #pragma once
 // Collects every system-log line written in this process while it lives.
 
-#include <chrono>
 #include <mutex>
 #include <string>
 #include <string_view>
-#include <thread>
 #include <vector>
 
 #include "platform/log/SystemLog.h"
+#include "support/Eventually.h"
 
 namespace qmtest {
 
@@ -45,13 +44,7 @@ public:
     }
     // Waits up to five seconds for a line holding the text.
     bool waitFor(const std::string& needle) const {
-        for (int i = 0; i < 500; ++i) {
-            if (contains(needle)) {
-                return true;
-            }
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        }
-        return false;
+        return eventually([&] { return contains(needle); });
     }
 
 private:

@@ -41,9 +41,9 @@ public:
         std::unique_lock lock(mutex_);
         return changed_.wait_for(lock, timeout, [&] { return replies_.size() >= count; });
     }
-    bool waitForEvents(std::size_t count, std::chrono::milliseconds timeout = std::chrono::seconds(5)) {
+    bool waitForEvents(std::size_t count) {
         std::unique_lock lock(mutex_);
-        return changed_.wait_for(lock, timeout, [&] { return events_.size() >= count; });
+        return changed_.wait_for(lock, std::chrono::seconds(5), [&] { return events_.size() >= count; });
     }
 
     qm::Result<qm::Value> reply(int tag) {
@@ -55,6 +55,12 @@ public:
         }
         ADD_FAILURE() << "no reply for " << tag;
         return qm::Error{"test", 0, "missing"};
+    }
+    // The reply's value; null (and a failure) when it is an error.
+    qm::Value value(int tag) {
+        auto result = reply(tag);
+        EXPECT_TRUE(result.ok()) << result.error().text();
+        return result.ok() ? *result : qm::Value();
     }
     std::vector<int> order() {
         std::lock_guard lock(mutex_);
