@@ -1,5 +1,7 @@
 // The Duct payload codec against hand-written CBOR: what it accepts, what it
-// refuses and why, and the exact bytes it writes.
+// refuses and why, the exact bytes it writes, and that decoding cannot
+// amplify: a payload whose tree would take more than sixteen times its size
+// (64 KiB at least) is refused before the tree is built.
 
 #include <gtest/gtest.h>
 
@@ -9,15 +11,19 @@
 #include <limits>
 #include <new>
 #include <string>
+#include <tuple>
 
 #include "platform/duct/CborCodec.h"
 
 // Every allocation of the test program goes through here, so a test can ask
-// how large the largest allocation was while the decoder ran.
+// how much was allocated, and the largest single allocation, while the
+// decoder ran.
 namespace {
 std::atomic<std::size_t> gLargestAllocation{0};
+std::atomic<std::size_t> gAllocatedBytes{0};
 
 void* allocate(std::size_t size) {
+    gAllocatedBytes.fetch_add(size, std::memory_order_relaxed);
     std::size_t largest = gLargestAllocation.load(std::memory_order_relaxed);
     while (size > largest && !gLargestAllocation.compare_exchange_weak(largest, size, std::memory_order_relaxed)) {
     }
@@ -240,6 +246,7 @@ TEST(CborCodec, RichValueSurvivesARoundTripWithItsTypes) {
     EXPECT_EQ(cbor::encode(*back), cbor::encode(rich));
 }
 
+// Lengths beyond the payload are refused without allocating for them.
 TEST(CborDecode, InvalidPayloadsAreRefusedWithTheirReason) {
     struct Case {
         std::string hex;
@@ -318,21 +325,19 @@ TEST(CborDecode, InvalidPayloadsAreRefusedWithTheirReason) {
         {"0102", "trailing bytes"},
         {"8000", "trailing bytes"},
         {"f6f6", "trailing bytes"},
+        // byte string, text, array and map of 2^60, and counts just past what the bytes could hold
+        {"5b1000000000000000" + repeated("00", 64), "truncated item"},
+        {"7b1000000000000000" + repeated("00", 64), "truncated item"},
+        {"9b1000000000000000" + repeated("00", 64), "truncated item"},
+        {"bb1000000000000000" + repeated("00", 64), "truncated item"},
+        {"9a7fffffff01", "truncated item"},
+        {"830102", "truncated item"},
+        {"a2616101", "truncated item"},
     };
+    gLargestAllocation = 0;
     for (const auto& [hexText, reason] : cases) {
         EXPECT_EQ(refusal(hexText), reason) << hexText;
     }
-}
-
-TEST(CborDecode, LengthsBeyondThePayloadAreRefusedWithoutAllocatingForThem) {
-    gLargestAllocation = 0;
-    for (const char* initial : {"5b", "7b", "9b", "bb"}) {  // byte string, text, array, map of 2^60
-        EXPECT_EQ(refusal(initial + std::string("1000000000000000") + repeated("00", 64)), "truncated item") << initial;
-    }
-    // Counts just past what the bytes could hold.
-    EXPECT_EQ(refusal("9a7fffffff01"), "truncated item");
-    EXPECT_EQ(refusal("830102"), "truncated item");
-    EXPECT_EQ(refusal("a2616101"), "truncated item");
     EXPECT_LT(gLargestAllocation.load(), 4096u);
 }
 
@@ -368,6 +373,65 @@ TEST(CborDecode, HostileDepthIsRefusedWithoutExhaustingTheStack) {
     Bytes encoded = cbor::encode(deep);
     EXPECT_EQ(encoded.size(), 2001u);
     EXPECT_EQ(refusal(encoded), tooDeep);
+}
+
+// One array head for `count` items followed by `count` copies of `item`.
+Bytes arrayOf(const Bytes& item, std::size_t count) {
+    Bytes out{0x9a};
+    for (int shift : {24, 16, 8, 0}) {
+        out.push_back(static_cast<std::uint8_t>(count >> shift));
+    }
+    out.reserve(out.size() + count * item.size());
+    for (std::size_t i = 0; i < count; ++i) {
+        out.insert(out.end(), item.begin(), item.end());
+    }
+    return out;
+}
+
+TEST(CborDecodedSize, APayloadIsRefusedWhenItsTreeWouldOutgrowItsBytes) {
+    constexpr std::size_t kFourMebibytes = 4 * 1024 * 1024;
+    const std::size_t fill = kFourMebibytes - 5;
+    Bytes hundredByteText{0x78, 98};  // a 2-byte head and 98 letters
+    hundredByteText.resize(100, 'x');
+    const std::tuple<const char*, Bytes, bool> cases[] = {
+        {"4 MiB: one array of empty arrays", arrayOf({0x80}, fill), false},
+        {"4 MiB: one array of empty maps", arrayOf({0xa0}, fill), false},
+        {"4 MiB: one array of empty strings", arrayOf({0x60}, fill), false},
+        {"4 MiB: one array of small integers", arrayOf({0x01}, fill), false},
+        {"4 MiB: a map holding one byte string",
+         cbor::encode(Value(Dictionary{{"blob", Value(Bytes(kFourMebibytes - 12, 0x5a))}})), true},
+        {"4 MiB: an array of 100-byte texts", arrayOf(hundredByteText, kFourMebibytes / 100), true},
+        {"2 KiB of empty arrays: within the 64 KiB floor", arrayOf({0x80}, 2048), true},
+    };
+    for (const auto& [what, payload, accepted] : cases) {
+        SCOPED_TRACE(what);
+        std::size_t before = gAllocatedBytes.load();
+        auto decoded = cbor::decodeMeasured(payload);
+        std::size_t allocated = gAllocatedBytes.load() - before;
+        ASSERT_EQ(decoded.ok(), accepted) << (decoded.ok() ? "" : decoded.error().text());
+        if (!decoded) {
+            EXPECT_NE(decoded.error().text().find("decoded size"), std::string::npos);
+            EXPECT_LT(allocated, payload.size());  // refused before the tree was built
+            continue;
+        }
+        // What the decoder reports is what the tree took, give or take its
+        // own working memory.
+        EXPECT_LE(decoded->allocatedBytes, allocated);
+        EXPECT_LE(allocated, decoded->allocatedBytes + 4096);
+        EXPECT_LE(decoded->allocatedBytes, cbor::decodedSizeBound(payload.size()));
+    }
+}
+
+TEST(CborDecodedSize, EmptyValuesShareOneObject) {
+    auto decoded = cbor::decode(Bytes{0x88, 0x80, 0x80, 0xa0, 0xa0, 0x60, 0x60, 0x40, 0x40});
+    ASSERT_TRUE(decoded);
+    const Array& items = *decoded->asArray();
+    const Value empties[] = {Value(Array()), Value(Dictionary()), Value(""), Value(Bytes())};
+    for (std::size_t i = 0; i < items.size(); i += 2) {
+        EXPECT_TRUE(items[i].isSameObject(items[i + 1])) << items[i].description();
+        EXPECT_TRUE(items[i].isSameObject(empties[i / 2])) << items[i].description();
+    }
+    EXPECT_FALSE(Value(Array{Value(1)}).isSameObject(Value(Array{Value(1)})));
 }
 
 }  // namespace
