@@ -7,15 +7,11 @@
 
 #include <string>
 
-#include "platform/plist/PropertyList.h"
 #include "support/TempDir.h"
 
 namespace {
 
-void writeInfo(const std::string& path, const qm::Dictionary& info) {
-    qmtest::writeFile(path, "");
-    ASSERT_FALSE(qm::plist::writeFileAtomically(path, qm::Value(info), qm::plist::Format::xml));
-}
+using qmtest::writePlist;
 
 // Without an executable (a data bundle) there is no "/Exec/" to tell a
 // desktop-style bundle by, so its support folder is the bundle itself.
@@ -38,7 +34,7 @@ TEST(QMBundle, SupportAndPlugInFoldersFollowTheLayout) {
         SCOPED_TRACE(c.what);
         std::string path = dir.file("B" + std::to_string(n++) + ".app");
         std::string executable = path + c.infoFolder + (c.infoFolder.empty() ? "/Foo" : "/Exec/Foo");
-        writeInfo(path + c.infoFolder + "/Info.plist",
+        writePlist(path + c.infoFolder + "/Info.plist",
                   c.executable ? qm::Dictionary{{"MRBundleExecutable", "Foo"}, {"MRBundleIdentifier", "com.example.foo"}}
                                : qm::Dictionary{{"MRBundleIdentifier", "com.example.foo"}});
         if (c.executable) {
@@ -66,8 +62,8 @@ TEST(QMBundle, SupportAndPlugInFoldersFollowTheLayout) {
 
 TEST(QMBundle, TheIdentifierIsAStringOrNothingAndTheUrlIsTheFileUrl) {
     qmtest::TempDir dir;
-    writeInfo(dir.file("N.xbun/Info.plist"), {{"MRBundleIdentifier", 5}});
-    writeInfo(dir.file("M.xbun/Info.plist"), {{"Other", "x"}});
+    writePlist(dir.file("N.xbun/Info.plist"), qm::Dictionary{{"MRBundleIdentifier", 5}});
+    writePlist(dir.file("M.xbun/Info.plist"), qm::Dictionary{{"Other", "x"}});
     qmtest::writeFile(dir.file("B.xbun/Info.plist"), "not a plist");
     for (const char* name : {"N.xbun", "M.xbun", "B.xbun"}) {
         auto bundle = QMBundle::initWithPath(dir.file(name));
@@ -79,7 +75,7 @@ TEST(QMBundle, TheIdentifierIsAStringOrNothingAndTheUrlIsTheFileUrl) {
     EXPECT_FALSE(QMBundle::initForMainBundle()) << "the test program lies in no bundle";
 
     std::string spaced = dir.file("With Space.app");
-    writeInfo(spaced + "/Info.plist", {{"MRBundleIdentifier", "x"}});
+    writePlist(spaced + "/Info.plist", qm::Dictionary{{"MRBundleIdentifier", "x"}});
     EXPECT_EQ(QMBundle::initWithPath(spaced)->url(), "file://" + dir.path() + "/With%20Space.app");
 }
 

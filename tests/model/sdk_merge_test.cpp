@@ -6,7 +6,6 @@
 #include "ModelTestSupport.h"
 #include "model/QMPlugInCore.h"
 #include "model/SdkRegistry.h"
-#include "platform/plist/PropertyList.h"
 #include "support/TempDir.h"
 
 namespace {
@@ -18,10 +17,7 @@ using modeltest::LogCapture;
 using modeltest::ScopedEnvironment;
 using qm::Value;
 
-void writePlist(const std::string& path, const Value& value) {
-    qmtest::writeFile(path, "");
-    ASSERT_EQ(qm::plist::writeFileAtomically(path, value, qm::plist::Format::xml), std::nullopt);
-}
+using qmtest::writePlist;
 
 Value sdkWithProtocol(const char* protocol) {
     return dict({{"VTExtension", dict({{"VTExtensionProtocol", protocol}})}});
@@ -175,17 +171,6 @@ TEST_F(SdkResolution, SdkDefaultsShowAtEveryLevelAfterResolution) {
                               "/apps/A.app/PlugIns/W.xbun");
     ASSERT_TRUE(extension);
     EXPECT_EQ(at(extension->plugInDictionary(), {"Shared"}), array({"."})) << "an extension shares only itself";
-}
-
-TEST_F(SdkResolution, TheTestSdkIsUsedAndTheSdkDirectoriesAreNotAsked) {
-    writePlist(testSdks + "/ovaro.s", sdkWithProtocol("from-test"));
-    qmtest::writeFile(first + "/ovaro.s.plist", "garbage that would fail loudly if read as the SDK");
-    ScopedEnvironment withTest("QMTEST_SDK", testSdks);
-    LogCapture log;
-    auto p = resolved(dict({{"VTExtensionPointIdentifier", "ovaro.s"}}));
-    ASSERT_TRUE(p);
-    EXPECT_EQ(p->protocolSpec(), Value("from-test"));
-    EXPECT_TRUE(log.lines().empty());
 }
 
 TEST_F(SdkResolution, WithoutAUsableSdkTheBundleIsLeftToValidation) {

@@ -56,48 +56,40 @@ void operator delete[](void* p, std::size_t) noexcept {
 namespace qm {
 namespace {
 
-// Bytes from hex digits; spaces are for the reader.
+// Bytes from hex digits; spaces (between bytes) are for the reader.
 Bytes hexBytes(std::string_view text) {
-    std::string digits;
-    for (char c : text) {
-        digits += c == ' ' ? "" : std::string(1, c);
-    }
     Bytes out;
-    for (std::size_t i = 0; i + 1 < digits.size(); i += 2) {
-        out.push_back(static_cast<std::uint8_t>(std::stoi(digits.substr(i, 2), nullptr, 16)));
+    for (std::size_t i = 0; i < text.size(); i += text[i] == ' ' ? 1 : 2) {
+        if (text[i] != ' ') {
+            out.push_back(static_cast<std::uint8_t>(std::stoi(std::string(text.substr(i, 2)), nullptr, 16)));
+        }
     }
     return out;
 }
 
 std::string hex(const Bytes& data) {
-    static const char* digits = "0123456789abcdef";
     std::string out;
     for (auto b : data) {
-        out += digits[b >> 4];
-        out += digits[b & 0xF];
+        out += {"0123456789abcdef"[b >> 4], "0123456789abcdef"[b & 0xF]};
     }
     return out;
 }
 
 std::string repeated(std::string_view hexByte, std::size_t count) {
     std::string out;
-    for (std::size_t i = 0; i < count; ++i) {
+    while (count-- > 0) {
         out += hexByte;
     }
     return out;
 }
 
-std::string refusal(const Bytes& payload) {
-    auto result = cbor::decode(payload);
-    if (result.ok()) {
-        return "accepted: " + result.value().description();
-    }
-    EXPECT_EQ(result.error().domain, "cbor");
-    return result.error().text();
-}
-
+// Why the decoder refused the payload.
 std::string refusal(std::string_view hexText) {
-    return refusal(hexBytes(hexText));
+    auto result = cbor::decode(hexBytes(hexText));
+    if (result.ok()) {
+        return "accepted: " + result->description();
+    }
+    return result.error().domain == "cbor" ? result.error().text() : "in domain " + result.error().domain;
 }
 
 // The nesting depth of a decoded value: arrays and packed values are one level each.
@@ -134,9 +126,10 @@ const Uuid kUuid = Uuid::fromBytes(hexBytes(kUuidHex).data() + 1);
 const std::string tooDeep = "nesting deeper than 512 levels";
 
 // Each case decodes to its value (of that very type), encodes to its bytes,
-// or both.
+// or both; a value without bytes survives the round trip.
 TEST(CborCodec, ValuesAndTheirEncodings) {
     enum Way { both, decodes, encodes };
+    Dictionary inner{{"when", Date{978307200.25}}, {"id", kUuid}, {"blob", Value(Bytes{0, 255, 7})}};
     struct Case {
         std::string hex;
         Value value;
@@ -206,10 +199,15 @@ TEST(CborCodec, ValuesAndTheirEncodings) {
         // Packed values after and inside others close at the right place.
         {"82 d818 46 82 d818 41 02 03 04",
          Value(Array{Value::packed(Value(Array{Value::packed(Value(2u)), Value(3u)})), Value(4u)})},
+        {"", Value(Dictionary{{"unsigned", Value(std::numeric_limits<std::uint64_t>::max())},
+                              {"signed", Value(std::numeric_limits<std::int64_t>::min())},
+                              {"flags", Value(Array{Value(true), Value(false), Value()})},
+                              {"packed", Value::packed(Value(inner))},
+                              {"nested", Value(Array{Value(inner), Value(Array{}), Value(Dictionary{})})}})},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.hex.substr(0, 40) + " " + c.value.description().substr(0, 40));
-        Bytes bytes = hexBytes(c.hex);
+        Bytes bytes = c.hex.empty() ? cbor::encode(c.value) : hexBytes(c.hex);
         if (c.way != encodes) {
             auto decoded = cbor::decode(bytes);
             ASSERT_TRUE(decoded.ok()) << decoded.error().text();
@@ -226,24 +224,6 @@ TEST(CborCodec, ValuesAndTheirEncodings) {
     Bytes appended{0xAB};
     cbor::encode(Value(7u), appended);
     EXPECT_EQ(hex(appended), "ab07");
-}
-
-TEST(CborCodec, RichValueSurvivesARoundTripWithItsTypes) {
-    Dictionary inner{{"when", Date{978307200.25}}, {"id", kUuid}, {"blob", Value(Bytes{0, 255, 7})}};
-    Value rich(Dictionary{
-        {"unsigned", Value(std::numeric_limits<std::uint64_t>::max())},
-        {"signed", Value(std::numeric_limits<std::int64_t>::min())},
-        {"real", Value(-0.125)},
-        {"flags", Value(Array{Value(true), Value(false), Value()})},
-        {"text", Value("h\xC3\xA9llo")},
-        {"packed", Value::packed(Value(inner))},
-        {"nested", Value(Array{Value(inner), Value(Array{}), Value(Dictionary{})})},
-    });
-    auto back = cbor::decode(cbor::encode(rich));
-    ASSERT_TRUE(back.ok());
-    EXPECT_EQ(*back, rich);
-    EXPECT_EQ(back->get("packed")->packedContent()->get("when")->asDate(), Date{978307200.25});
-    EXPECT_EQ(cbor::encode(*back), cbor::encode(rich));
 }
 
 // Lengths beyond the payload are refused without allocating for them.
@@ -372,7 +352,7 @@ TEST(CborDecode, HostileDepthIsRefusedWithoutExhaustingTheStack) {
     }
     Bytes encoded = cbor::encode(deep);
     EXPECT_EQ(encoded.size(), 2001u);
-    EXPECT_EQ(refusal(encoded), tooDeep);
+    EXPECT_EQ(refusal(hex(encoded)), tooDeep);
 }
 
 // One array head for `count` items followed by `count` copies of `item`.

@@ -7,7 +7,6 @@
 #include <functional>
 #include <string>
 
-#include "platform/plist/PropertyList.h"
 #include "support/LogCapture.h"
 #include "support/TempDir.h"
 
@@ -26,14 +25,12 @@ struct Bundle {
         path = dir.file(desktopStyle ? "Desk.app" : "Flat.app");
         infoFolder = desktopStyle ? path + "/Contents" : path;
         entitlements = infoFolder + "/Entitlements.plist";
-        qmtest::writeFile(infoFolder + "/Info.plist", "");
-        EXPECT_FALSE(qm::plist::writeFileAtomically(infoFolder + "/Info.plist", qm::Value(qm::Dictionary{{"MRBundleIdentifier", "x"}}),
-                                                    qm::plist::Format::xml));
+        qmtest::writePlist(infoFolder + "/Info.plist", qm::Dictionary{{"MRBundleIdentifier", "x"}});
         write(kGranted);
         EXPECT_EQ(::chmod(infoFolder.c_str(), 0755), 0);
     }
     void write(const qm::Value& value) {
-        EXPECT_FALSE(qm::plist::writeFileAtomically(entitlements, value, qm::plist::Format::xml));
+        qmtest::writePlist(entitlements, value);
         EXPECT_EQ(::chmod(entitlements.c_str(), 0644), 0);
     }
     std::optional<qm::Value> read() const { return qm::readEntitlements(*qm::BundleDirectory::atPath(path)); }

@@ -3,12 +3,10 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
 #include <functional>
 #include <future>
-#include <mutex>
 #include <thread>
 #include <vector>
 
@@ -18,25 +16,14 @@ using qm::SerialQueue;
 
 namespace {
 
+// Holds the queue a job runs on until released.
 struct Gate {
-    std::mutex mutex;
-    std::condition_variable changed;
-    bool open = false;
-    bool entered = false;
+    std::promise<void> entered, released;
+    std::future<void> in = entered.get_future();
+    std::shared_future<void> open = released.get_future().share();
     void enterAndWait() {
-        std::unique_lock lock(mutex);
-        entered = true;
-        changed.notify_all();
-        changed.wait(lock, [&] { return open; });
-    }
-    void waitEntered() {
-        std::unique_lock lock(mutex);
-        changed.wait(lock, [&] { return entered; });
-    }
-    void release() {
-        std::lock_guard lock(mutex);
-        open = true;
-        changed.notify_all();
+        entered.set_value();
+        open.wait();
     }
 };
 
@@ -134,25 +121,7 @@ TEST(SerialQueue, AJobOnAQueueNeverRunsAnotherQueuesAsyncJobInline) {
     EXPECT_FALSE(outerCurrentInsideSync);
 }
 
-TEST(SerialQueue, SyncWaitsBehindQueuedWork) {
-    SerialQueue queue("behind");
-    Gate gate;
-    std::vector<int> order;
-    queue.async([&] {
-        gate.enterAndWait();
-        order.push_back(1);
-    });
-    gate.waitEntered();
-    queue.async([&] { order.push_back(2); });
-    std::thread releaser([&] {
-        std::this_thread::sleep_for(std::chrono::milliseconds(20));
-        gate.release();
-    });
-    queue.sync([&] { order.push_back(3); });
-    releaser.join();
-    EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
-}
-
+// A sync() call waits behind the work already queued.
 TEST(SerialQueue, AnIdleInlineQueueRunsOnTheCallerAndABusyOneOnItsWorker) {
     SerialQueue queue("inline", qm::QualityOfService::userInitiated, /*runsInlineWhenIdle=*/true);
     std::thread::id ranOn;
@@ -168,17 +137,20 @@ TEST(SerialQueue, AnIdleInlineQueueRunsOnTheCallerAndABusyOneOnItsWorker) {
             order.push_back(1);
         });
     });
-    gate.waitEntered();
+    gate.in.wait();
     EXPECT_TRUE(queue.busy());
     std::thread::id secondRanOn;
     queue.async([&] {
         secondRanOn = std::this_thread::get_id();
         order.push_back(2);
     });
-    queue.async([&] { order.push_back(3); });
-    gate.release();
+    std::thread releaser([&] {
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+        gate.released.set_value();
+    });
+    queue.sync([&] { order.push_back(3); });
+    releaser.join();
     holder.join();
-    queue.sync([] {});
     EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
     EXPECT_NE(secondRanOn, std::this_thread::get_id());
     EXPECT_NE(secondRanOn, std::thread::id());
@@ -190,11 +162,11 @@ TEST(SerialQueue, PendingJobsRunBeforeTheQueueGoes) {
         SerialQueue queue("drain");
         Gate gate;
         queue.async([&] { gate.enterAndWait(); });
-        gate.waitEntered();
+        gate.in.wait();
         for (int i = 0; i < 100; ++i) {
             queue.async([&] { count.fetch_add(1); });
         }
-        gate.release();
+        gate.released.set_value();
     }
     EXPECT_EQ(count.load(), 100);
 }

@@ -28,6 +28,12 @@ void writeFile(const std::string& path, const std::string& text) {
     EXPECT_TRUE(out.good()) << path;
 }
 
+void writePlist(const std::string& path, const qm::Value& value, qm::plist::Format format) {
+    std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+    auto error = qm::plist::writeFileAtomically(path, value, format);
+    EXPECT_FALSE(error) << path << ": " << error->text();
+}
+
 std::string readFile(const std::string& path) {
     std::ifstream in(path, std::ios::binary);
     std::stringstream text;
