@@ -6,6 +6,7 @@
 
 #include <cerrno>
 #include <functional>
+#include <tuple>
 
 #include "client/QMDaemonClient.h"
 #include "support/FramePeer.h"
@@ -103,12 +104,8 @@ TEST_F(DaemonClient, EveryRequestSendsItsEnvelopeAndKeysAndGetsItsOwnReply) {
 }
 
 TEST_F(DaemonClient, ErrorRepliesBecomeQuamberErrorsWithTheirCodeAndMessage) {
-    struct Case {
-        qm::Result<Value> reply;
-        std::optional<std::int64_t> code;  // nothing: success
-        std::string message;
-    };
-    const Case cases[] = {
+    // {reply, code (nothing: success), message}
+    const std::tuple<qm::Result<Value>, std::optional<std::int64_t>, std::string> cases[] = {
         {qmtest::request({{"errorcode", std::uint64_t{14}}, {"error", "plug-ins are busy"}, {"conflicts", Value(Array{})}}),
          14, "plug-ins are busy"},
         {qmtest::request({{"errorcode", std::uint64_t{9}}}), 9, "unknown error returned by Quamber subsystem"},
@@ -129,17 +126,17 @@ TEST_F(DaemonClient, ErrorRepliesBecomeQuamberErrorsWithTheirCodeAndMessage) {
         {qm::Error{"duct", ECONNRESET, "connection invalid: daemon closed the connection"}, 4,
          "connection invalid: daemon closed the connection"},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.reply.ok() ? c.reply->description() : c.reply.error().text());
-        auto error = QMDaemonClient::errorInReply(c.reply);
-        if (!c.code) {
+    for (const auto& [reply, code, message] : cases) {
+        SCOPED_TRACE(reply.ok() ? reply->description() : reply.error().text());
+        auto error = QMDaemonClient::errorInReply(reply);
+        if (!code) {
             EXPECT_FALSE(error.has_value()) << error->text();
             continue;
         }
         ASSERT_TRUE(error.has_value());
         EXPECT_EQ(error->domain, "Quamber");
-        EXPECT_EQ(error->code, *c.code);
-        EXPECT_EQ(error->text(), c.message);
+        EXPECT_EQ(error->code, *code);
+        EXPECT_EQ(error->text(), message);
     }
 }
 

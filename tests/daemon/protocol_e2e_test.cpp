@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include <tuple>
+
 #include "support/DaemonProcess.h"
 #include "support/FramePeer.h"
 
@@ -20,13 +22,9 @@ namespace {
 TEST(Protocol, EachRequestIsAnsweredInOrderOnceItsEnvelopeIsChecked) {
     DaemonProcess daemon;
     FramePeer client(daemon.socketPath());
-    struct Case {
-        qm::Value message;
-        std::optional<std::uint64_t> code;  // nothing: served, with an empty reply
-        const char* text;
-    };
+    // {message, error code (nothing: served, with an empty reply), error text}
     auto named = [](qm::Value name) { return request({{"request", name}, {"version", std::uint64_t{3}}}); };
-    const Case cases[] = {
+    const std::tuple<qm::Value, std::optional<std::uint64_t>, const char*> cases[] = {
         {bulk(3), std::nullopt, ""},
         {bulk(2), std::nullopt, ""},
         {request({{"request", "bulk"}, {"version", std::int64_t{3}}}), std::nullopt, ""},  // the same number
@@ -52,21 +50,21 @@ TEST(Protocol, EachRequestIsAnsweredInOrderOnceItsEnvelopeIsChecked) {
     std::vector<std::uint64_t> ids;
     for (int round = 0; round < kRounds; ++round) {
         client.send(qm::Value(qm::Array{"request", "bulk"}));
-        for (const Case& c : cases) {
-            ids.push_back(client.send(c.message));
+        for (const auto& c : cases) {
+            ids.push_back(client.send(std::get<0>(c)));
         }
     }
     for (std::size_t i = 0; i < ids.size(); ++i) {
-        const Case& c = cases[i % std::size(cases)];
-        SCOPED_TRACE(c.message.description());
+        const auto& [message, code, text] = cases[i % std::size(cases)];
+        SCOPED_TRACE(message.description());
         auto frame = client.receive();
         ASSERT_TRUE(frame);
         EXPECT_EQ(frame->kind, 2u);
         EXPECT_EQ(frame->id, ids[i]);
         ASSERT_TRUE(frame->body.asDictionary());
-        EXPECT_EQ(errorCode(frame->body), c.code);
-        EXPECT_EQ(errorText(frame->body), c.text);
-        EXPECT_EQ(frame->body.asDictionary()->size(), c.code ? 2u : 0u) << frame->body.description();
+        EXPECT_EQ(errorCode(frame->body), code);
+        EXPECT_EQ(errorText(frame->body), text);
+        EXPECT_EQ(frame->body.asDictionary()->size(), code ? 2u : 0u) << frame->body.description();
     }
     EXPECT_TRUE(daemon.waitForLog("unexpected message (request, bulk) on connection"));
     EXPECT_TRUE(daemon.waitForLog("bulk options 0x0 not supported"));
@@ -75,32 +73,29 @@ TEST(Protocol, EachRequestIsAnsweredInOrderOnceItsEnvelopeIsChecked) {
 
 // Debug lines include the count of every thousandth request of a client.
 TEST(Protocol, VerbosityChoosesWhatIsLogged) {
-    struct Case {
-        std::vector<std::string> flags;
-        bool debugLines;
-        bool fullRequests;
-    };
+    using Case = std::tuple<std::vector<std::string>, bool, bool>;  // flags, debug lines, full requests
     const qm::Value nope = request({{"request", "nope"}, {"version", std::uint64_t{3}}});
     const std::string client = "client " + std::to_string(::getpid()) + " ";
-    for (const Case& c : {Case{{}, false, false}, Case{{"-v"}, true, false}, Case{{"-v", "-v"}, true, true}}) {
-        DaemonProcess daemon(c.flags);
+    for (const auto& [flags, debugLines, fullRequests] :
+         {Case{{}, false, false}, Case{{"-v"}, true, false}, Case{{"-v", "-v"}, true, true}}) {
+        DaemonProcess daemon(flags);
         FramePeer peer(daemon.socketPath());
         ASSERT_TRUE(peer.roundTrip(bulk()));
         ASSERT_TRUE(peer.roundTrip(nope));
         ASSERT_TRUE(daemon.waitForLog("bulk options 0x0 not supported"));  // always written
-        EXPECT_EQ(daemon.waitForLog(client + "request bulk", std::chrono::milliseconds(300)), c.debugLines);
-        EXPECT_EQ(daemon.log().find(client + "/") != std::string::npos, c.debugLines);
-        EXPECT_EQ(daemon.log().find("incoming request {request = nope; version = 3}") != std::string::npos, c.fullRequests);
+        EXPECT_EQ(daemon.waitForLog(client + "request bulk", std::chrono::milliseconds(300)), debugLines);
+        EXPECT_EQ(daemon.log().find(client + "/") != std::string::npos, debugLines);
+        EXPECT_EQ(daemon.log().find("incoming request {request = nope; version = 3}") != std::string::npos, fullRequests);
         EXPECT_EQ(daemon.log().find("Replying {error = \"unrecognized request\"; errorcode = 4}") != std::string::npos,
-                  c.fullRequests);
+                  fullRequests);
         for (int i = 3; i <= 2000; ++i) {
             EXPECT_TRUE(i != 1000 || daemon.log().find(client + "used ") == std::string::npos) << "counted early";
             peer.send(nope);
             ASSERT_TRUE(peer.receive());
         }
-        EXPECT_EQ(daemon.waitForLog(client + "used 2000 requests so far", std::chrono::milliseconds(c.debugLines ? 5000 : 300)),
-                  c.debugLines);
-        EXPECT_EQ(daemon.log().find(client + "used 1000 requests so far") != std::string::npos, c.debugLines);
+        EXPECT_EQ(daemon.waitForLog(client + "used 2000 requests so far", std::chrono::milliseconds(debugLines ? 5000 : 300)),
+                  debugLines);
+        EXPECT_EQ(daemon.log().find(client + "used 1000 requests so far") != std::string::npos, debugLines);
         EXPECT_EQ(daemon.log().find(client + "used 999 "), std::string::npos);
     }
 }

@@ -54,13 +54,9 @@ TEST(Startup, RefusalsAtStartNameTheirCauseAndChangeNothing) {
         ASSERT_EQ(::mkdir(path.c_str(), 0700), 0);
         ASSERT_EQ(::chmod(path.c_str(), mode), 0);
     }
-    struct Case {
-        std::vector<std::string> arguments;
-        std::map<std::string, std::string> environment;
-        std::string says;
-    };
+    // {arguments, environment, what standard error says}
     std::string duct = dir.file("duct");
-    std::vector<Case> cases = {
+    std::vector<std::tuple<std::vector<std::string>, std::map<std::string, std::string>, std::string>> cases = {
         {{"-S", ""}, {{"QM_DUCT_DIR", duct}}, "invalid service name"},
         {{"-S", "a/b"}, {{"QM_DUCT_DIR", duct}}, "invalid service name"},
         {{}, {{"QM_DUCT_DIR", dir.file("notadir")}}, "is not a directory"},
@@ -71,12 +67,12 @@ TEST(Startup, RefusalsAtStartNameTheirCauseAndChangeNothing) {
     for (const char* idle : {"abc", "0", "-5", " 5", "99999999999"}) {
         cases.push_back({{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", idle}}, "QM_IDLE_EXIT"});
     }
-    for (const Case& c : cases) {
+    for (const auto& [arguments, environment, says] : cases) {
         std::vector<std::string> argv{QMD_BINARY_PATH};
-        argv.insert(argv.end(), c.arguments.begin(), c.arguments.end());
-        auto result = runProgram(argv, c.environment);
-        EXPECT_EQ(result.exitStatus, 1) << c.says;
-        EXPECT_NE(result.err.find(c.says), std::string::npos) << result.err;
+        argv.insert(argv.end(), arguments.begin(), arguments.end());
+        auto result = runProgram(argv, environment);
+        EXPECT_EQ(result.exitStatus, 1) << says;
+        EXPECT_NE(result.err.find(says), std::string::npos) << result.err;
         EXPECT_NE(result.err.find("unable to construct server"), std::string::npos) << result.err;
     }
     for (mode_t mode : {0755, 01777, 0710}) {

@@ -3,6 +3,8 @@
 
 #include <gtest/gtest.h>
 
+#include <tuple>
+
 #include "ModelTestSupport.h"
 #include "model/QMError.h"
 #include "model/QMPlugInCore.h"
@@ -305,26 +307,22 @@ TEST(PlugInCanonical, CanonicalValuesAndTheDiagnosis) {
 }
 
 TEST(PlugInComputed, PropertiesReadThePlugInDictionary) {
-    struct Case {
-        Value top;
-        bool data, dedicated, hybrid;
-        Value sdk, embeddedProtocol;
-    };
-    const Case cases[] = {
+    // {top dictionary, data, dedicated, hybrid, SDK, embedded protocol}
+    const std::tuple<Value, bool, bool, bool, Value, Value> cases[] = {
         {dict({{"VTExtensionProtocol", "#Data"}, {"VTExtensionPointIdentifier", "ovaro.sdk"}, {"Dedicated", true}}),
          true, true, false, Value("ovaro.sdk"), Value("#Data")},  // the embedded protocol falls back to the protocol
         {dict({{"VTExtensionProtocol", "P"}, {"EmbeddedProtocol", "E"}}), false, false, false, Value(), Value("E")},
         {dict({{"Dedicated", false}, {"EmbeddedCode", false}}), false, false, true, Value(), Value()},  // any value counts
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.top.description());
-        auto plugIn = setUp(newStyleInfo(c.top));
+    for (const auto& [top, data, dedicated, hybrid, sdk, embeddedProtocol] : cases) {
+        SCOPED_TRACE(top.description());
+        auto plugIn = setUp(newStyleInfo(top));
         ASSERT_TRUE(plugIn);
-        EXPECT_EQ(plugIn->isData(), c.data);
-        EXPECT_EQ(plugIn->isDedicated(), c.dedicated);
-        EXPECT_EQ(plugIn->isHybrid(), c.hybrid);
-        EXPECT_EQ(plugIn->sdkSpec(), c.sdk);
-        EXPECT_EQ(plugIn->embeddedProtocolSpec(), c.embeddedProtocol);
+        EXPECT_EQ(plugIn->isData(), data);
+        EXPECT_EQ(plugIn->isDedicated(), dedicated);
+        EXPECT_EQ(plugIn->isHybrid(), hybrid);
+        EXPECT_EQ(plugIn->sdkSpec(), sdk);
+        EXPECT_EQ(plugIn->embeddedProtocolSpec(), embeddedProtocol);
         EXPECT_FALSE(plugIn->isAppExtension());
         EXPECT_EQ(plugIn->embeddedCodePath(), std::nullopt);
         plugIn->setLastModified(-86400);

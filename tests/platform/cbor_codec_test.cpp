@@ -228,11 +228,7 @@ TEST(CborCodec, ValuesAndTheirEncodings) {
 
 // Lengths beyond the payload are refused without allocating for them.
 TEST(CborDecode, InvalidPayloadsAreRefusedWithTheirReason) {
-    struct Case {
-        std::string hex;
-        std::string reason;
-    };
-    const Case cases[] = {
+    const std::pair<std::string, std::string> cases[] = {
         {"", "empty payload"},
         {"3b8000000000000000", "negative integer below -2^63"},
         {"3bffffffffffffffff", "negative integer below -2^63"},

@@ -7,6 +7,7 @@
 #include <cmath>
 #include <limits>
 #include <string>
+#include <tuple>
 
 #include "platform/value/Json.h"
 
@@ -18,11 +19,7 @@ constexpr auto kU64Max = std::numeric_limits<std::uint64_t>::max();
 constexpr auto kI64Min = std::numeric_limits<std::int64_t>::min();
 
 TEST(Json, WritesEachTypeInItsSpelling) {
-    struct Case {
-        Value value;
-        std::string compact;
-    };
-    const Case cases[] = {
+    const std::pair<Value, std::string> cases[] = {
         {Value(), "null"},
         {Value(false), "false"},
         {Value(kU64Max), "18446744073709551615"},
@@ -48,8 +45,8 @@ TEST(Json, WritesEachTypeInItsSpelling) {
         // Bytes that are not UTF-8 cannot be written as they are.
         {Value("a\xFF" "b\xED\xA0\x80"), "\"a\xEF\xBF\xBD" "b\xEF\xBF\xBD\xEF\xBF\xBD\xEF\xBF\xBD\""},
     };
-    for (const Case& c : cases) {
-        EXPECT_EQ(json::write(c.value, false), c.compact) << c.value.description();
+    for (const auto& [value, compact] : cases) {
+        EXPECT_EQ(json::write(value, false), compact) << value.description();
     }
 }
 
@@ -73,12 +70,7 @@ TEST(Json, WritesContainersCompactAndPretty) {
 }
 
 TEST(Json, ParsesValuesWithTheirTypes) {
-    struct Case {
-        std::string text;
-        Value expected;
-        ValueType type;
-    };
-    const Case cases[] = {
+    const std::tuple<std::string, Value, ValueType> cases[] = {
         {" null ", Value(), ValueType::null},
         {"true", Value(true), ValueType::boolean},
         {"0", Value(0u), ValueType::unsignedInteger},
@@ -107,20 +99,15 @@ TEST(Json, ParsesValuesWithTheirTypes) {
         {R"({"$uuid": "x", "y": 1})", Value(Dictionary{{"$uuid", Value("x")}, {"y", Value(1u)}}), ValueType::dictionary},
         {R"({"$other": 1})", Value(Dictionary{{"$other", Value(1u)}}), ValueType::dictionary},
     };
-    for (const Case& c : cases) {
-        auto parsed = json::parse(c.text);
-        ASSERT_TRUE(parsed.ok()) << c.text << ": " << parsed.error().text();
-        EXPECT_EQ(*parsed, c.expected) << c.text;
-        EXPECT_EQ(parsed->type(), c.type) << c.text;
+    for (const auto& [text, expected, type] : cases) {
+        auto parsed = json::parse(text);
+        ASSERT_TRUE(parsed.ok()) << text << ": " << parsed.error().text();
+        EXPECT_EQ(*parsed, expected) << text;
+        EXPECT_EQ(parsed->type(), type) << text;
     }
 }
 
 TEST(Json, RefusalsSayWhatAndWhere) {
-    struct Case {
-        std::string text;
-        std::string reason;  // a part of the message
-        std::string where;   // how the message ends
-    };
     const std::string deepObjects = [] {
         std::string text;
         for (int i = 0; i < 513; ++i) {
@@ -128,7 +115,8 @@ TEST(Json, RefusalsSayWhatAndWhere) {
         }
         return text + "1" + std::string(513, '}');
     }();
-    const Case cases[] = {
+    // {text, a part of the message, how the message ends}
+    const std::tuple<std::string, std::string, std::string> cases[] = {
         {"", "unexpected end of input", "line 1, column 1"},
         {"[1,\n 2]\n x", "invalid literal; expected end of input", "line 3, column 2"},
         {"{a:1}", "object key - invalid literal; expected string literal", "line 1, column 2"},
@@ -151,13 +139,13 @@ TEST(Json, RefusalsSayWhatAndWhere) {
         {R"({"$uuid": 5})", "\"$uuid\" needs a UUID", "line 1, column 1"},
         {R"({"$date": "2001-02-29T00:00:00Z"})", "\"$date\" needs an RFC 3339 date-time", "line 1, column 1"},
     };
-    for (const Case& c : cases) {
-        auto result = json::parse(c.text);
-        ASSERT_FALSE(result.ok()) << c.text << " gave " << result.value().description();
+    for (const auto& [text, reason, where] : cases) {
+        auto result = json::parse(text);
+        ASSERT_FALSE(result.ok()) << text << " gave " << result.value().description();
         EXPECT_EQ(result.error().domain, "json");
         const std::string& message = result.error().text();
-        EXPECT_NE(message.find(c.reason), std::string::npos) << message;
-        EXPECT_TRUE(message.ends_with(" at " + c.where)) << message;
+        EXPECT_NE(message.find(reason), std::string::npos) << message;
+        EXPECT_TRUE(message.ends_with(" at " + where)) << message;
         EXPECT_EQ(message.find("last read"), std::string::npos) << message;
     }
     EXPECT_TRUE(json::parse(std::string(512, '[') + std::string(512, ']')).ok());

@@ -6,6 +6,8 @@
 
 #include <gtest/gtest.h>
 
+#include <tuple>
+
 #include "platform/duct/Frame.h"
 #include "support/LogCapture.h"
 #include "support/TransportServer.h"
@@ -108,25 +110,19 @@ TEST(PeerTransport, ADecodedRequestWaitsUntilAnAnswerMakesRoom) {
 }
 
 TEST(PeerTransport, WhileAConnectionWaitsOthersAreServedAndItsHangUpIsSeen) {
-    struct Case {
-        const char* what;
-        ReceiveLimits limits;
-        Pool pool;
-        Bytes filler;  // fills the pool from a connection of its own
-        Bytes victim;  // makes its connection wait
-    };
-    const Case cases[] = {
+    // {what, limits, pool, what fills the pool from a connection of its own, what makes its connection wait}
+    const std::tuple<const char*, ReceiveLimits, Pool, Bytes, Bytes> cases[] = {
         {"partial pool", ReceiveLimits{.partialBytes = 1000, .stallTimeout = 60s}, Pool::partial, hoard(), request(1, 5000)},
         {"decoded pool", ReceiveLimits{.decodedBytes = 100 * 1024}, Pool::decoded, {}, twoRequests()},
     };
-    for (const auto& c : cases) {
-        SCOPED_TRACE(c.what);
-        Server server(c.limits);
-        if (!c.filler.empty()) {
-            server.connect(c.filler);
+    for (const auto& [what, limits, pool, filler, waiter] : cases) {
+        SCOPED_TRACE(what);
+        Server server(limits);
+        if (!filler.empty()) {
+            server.connect(filler);
         }
-        auto& victim = server.connect(c.victim);
-        ASSERT_TRUE(eventually([&] { return server.budget().waiting(c.pool) == 1; }));
+        auto& victim = server.connect(waiter);
+        ASSERT_TRUE(eventually([&] { return server.budget().waiting(pool) == 1; }));
         // A connection holding nothing and with nothing in flight is admitted.
         auto& bystander = server.connect(request(9, 10));
         ASSERT_TRUE(eventually([&] {

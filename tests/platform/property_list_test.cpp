@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <limits>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "support/TempDir.h"
@@ -148,12 +149,8 @@ TEST_P(PropertyListFormats, ValuesWithoutAPropertyListFormAreRefused) {
         deep = Value(Array{deep});
     }
     EXPECT_TRUE(qm::plist::serialize(deep, GetParam()).ok());
-    struct Case {
-        Value value;
-        int code;
-        const char* where;
-    };
-    const Case cases[] = {
+    // {value, error code, where the message says it is}
+    const std::tuple<Value, int, const char*> cases[] = {
         {Value(std::uint64_t{1} << 63), qm::plist::kErrorUnsupported, ""},
         {Value(qm::Date{kEarliest - 1}), qm::plist::kErrorUnsupported, "date"},
         {Value(qm::Date{kLatest + 1}), qm::plist::kErrorUnsupported, "date"},
@@ -168,12 +165,12 @@ TEST_P(PropertyListFormats, ValuesWithoutAPropertyListFormAreRefused) {
         {Value(Dictionary{{"\xc3", Value(1)}}), qm::plist::kErrorUnsupported, ""},
         {Value(Array{deep}), qm::plist::kErrorTooComplex, ""},
     };
-    for (const Case& c : cases) {
-        auto bytes = qm::plist::serialize(c.value, GetParam());
-        ASSERT_FALSE(bytes.ok()) << c.value.description();
+    for (const auto& [value, code, where] : cases) {
+        auto bytes = qm::plist::serialize(value, GetParam());
+        ASSERT_FALSE(bytes.ok()) << value.description();
         EXPECT_EQ(bytes.error().domain, qm::plist::kErrorDomain);
-        EXPECT_EQ(bytes.error().code, c.code) << c.value.description();
-        EXPECT_NE(bytes.error().text().find(c.where), std::string::npos) << bytes.error().text();
+        EXPECT_EQ(bytes.error().code, code) << value.description();
+        EXPECT_NE(bytes.error().text().find(where), std::string::npos) << bytes.error().text();
     }
 }
 
@@ -194,12 +191,7 @@ TEST(PropertyList, BinaryKeepsFractionsOfSecondsXmlWritesWholeOnes) {
 }
 
 TEST(PropertyList, XmlDocumentsReadAsTheirValues) {
-    struct Case {
-        const char* what;
-        std::string body;
-        Value expected;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, std::string, Value> cases[] = {
         {"a typical Info file", R"(<!-- a comment -->
 <dict>
 	<key>MRBundleIdentifier</key>
@@ -224,11 +216,11 @@ TEST(PropertyList, XmlDocumentsReadAsTheirValues) {
         {"dates outside the writable range", "<array><date>9999-01-01T00:00:00Z</date><date>1900-01-01T00:00:00Z</date></array>",
          Value(Array{qm::Date{253370764800.0}, qm::Date{-2208988800.0}})},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.what);
-        auto value = qm::plist::parse(bytesOf(xmlDocument(c.body)));
+    for (const auto& [what, body, expected] : cases) {
+        SCOPED_TRACE(what);
+        auto value = qm::plist::parse(bytesOf(xmlDocument(body)));
         ASSERT_TRUE(value.ok()) << value.error().text();
-        EXPECT_EQ(*value, c.expected);
+        EXPECT_EQ(*value, expected);
     }
     EXPECT_TRUE(qm::plist::parse(bytesOf(nestedXml(qm::plist::kMaxNesting))).ok());
 }
@@ -238,11 +230,7 @@ TEST(PropertyList, BrokenOrHostileXmlIsRefusedWithoutCrashing) {
     for (int i = 0; i < 200000; ++i) {
         unfinished += "<array>";
     }
-    struct Case {
-        std::string document;
-        int code;
-    };
-    const Case cases[] = {
+    const std::pair<std::string, int> cases[] = {
         {"", qm::plist::kErrorMalformed},
         {"garbage", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><dict><key>a</key>", qm::plist::kErrorMalformed},
@@ -261,11 +249,11 @@ TEST(PropertyList, BrokenOrHostileXmlIsRefusedWithoutCrashing) {
         {unfinished, qm::plist::kErrorTooComplex},
         {std::string(qm::plist::kMaxBytes + 1, ' '), qm::plist::kErrorTooComplex},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.document.substr(0, 80));
-        expectRefused(qm::plist::parse(bytesOf(c.document)), c.code);
+    for (const auto& [document, code] : cases) {
+        SCOPED_TRACE(document.substr(0, 80));
+        expectRefused(qm::plist::parse(bytesOf(document)), code);
     }
-    auto notUtf8 = qm::plist::parse(bytesOf(cases[8].document));
+    auto notUtf8 = qm::plist::parse(bytesOf(cases[8].first));
     EXPECT_NE(notUtf8.error().text().find("/1"), std::string::npos) << "names where";
 }
 

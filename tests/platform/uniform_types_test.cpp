@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 
 #include <string>
+#include <tuple>
 
 #include "support/LogCapture.h"
 #include "support/ScopedEnvironment.h"
@@ -46,12 +47,8 @@ protected:
 TEST_F(UniformTypesTest, TypesAreComparedAfterCaseAndAliasesAndConformUpwards) {
     qmtest::LogCapture log;
     auto types = load();
-    struct Case {
-        const char* type;
-        const char* toType;
-        bool conforms;
-    };
-    const Case cases[] = {
+    // {type, to type, conforms}
+    const std::tuple<const char*, const char*, bool> cases[] = {
         {"image/svg+xml", "image/svg+xml", true},
         {"IMAGE/SVG+XML", "image/Svg+Xml", true},
         {"image/svg+xml", "application/xml", true},
@@ -71,8 +68,8 @@ TEST_F(UniformTypesTest, TypesAreComparedAfterCaseAndAliasesAndConformUpwards) {
         {"", "application/octet-stream", false},
         {"three", "words", false},
     };
-    for (const auto& c : cases) {
-        EXPECT_EQ(types.conforms(c.type, c.toType), c.conforms) << c.type << " -> " << c.toType;
+    for (const auto& [type, toType, conforms] : cases) {
+        EXPECT_EQ(types.conforms(type, toType), conforms) << type << " -> " << toType;
     }
     EXPECT_EQ(log.countContaining("1 malformed lines skipped"), 1u);
 
