@@ -136,57 +136,33 @@ TEST(CborCodec, ValuesAndTheirEncodings) {
         Way way = both;
     };
     const Case cases[] = {
-        {"00", std::uint64_t{0}},
-        {"17", std::uint64_t{23}},
-        {"1818", std::uint64_t{24}},
-        {"18ff", std::uint64_t{255}},
-        {"190100", std::uint64_t{256}},
-        {"19ffff", std::uint64_t{65535}},
-        {"1a00010000", std::uint64_t{65536}},
-        {"1affffffff", std::uint64_t{4294967295u}},
-        {"1b0000000100000000", std::uint64_t{4294967296u}},
+        // Integers take the shortest head, at every boundary; non-negative
+        // signed ones travel as major type 0.
+        {"00", 0u}, {"17", 23u}, {"1818", 24u}, {"18ff", 255u}, {"190100", 256u}, {"19ffff", 65535u},
+        {"1a00010000", 65536u}, {"1affffffff", 4294967295u}, {"1b0000000100000000", std::uint64_t{4294967296u}},
         {"1bffffffffffffffff", std::numeric_limits<std::uint64_t>::max()},
-        {"05", std::int64_t{5}, encodes},  // non-negative travels as major type 0
-        {"1903e8", std::int64_t{1000}, encodes},
-        {"20", std::int64_t{-1}},
-        {"37", std::int64_t{-24}},
-        {"3818", std::int64_t{-25}},
-        {"390100", std::int64_t{-257}},
-        {"3a00010000", std::int64_t{-65537}},
-        {"3b0000000100000000", std::int64_t{-4294967297}},
-        {"3b7fffffffffffffff", std::numeric_limits<std::int64_t>::min()},
+        {"05", std::int64_t{5}, encodes}, {"1903e8", std::int64_t{1000}, encodes},
+        {"20", -1}, {"37", -24}, {"3818", -25}, {"390100", -257}, {"3a00010000", -65537},
+        {"3b0000000100000000", std::int64_t{-4294967297}}, {"3b7fffffffffffffff", std::numeric_limits<std::int64_t>::min()},
         // Floats of every width are doubles; doubles go out 64-bit.
-        {"f93c00", 1.0, decodes},
-        {"f9c400", -4.0, decodes},
-        {"f97bff", 65504.0, decodes},
+        {"f93c00", 1.0, decodes}, {"f9c400", -4.0, decodes}, {"f97bff", 65504.0, decodes},
         {"f90001", std::ldexp(1.0, -24), decodes},  // smallest subnormal half
-        {"f97c00", std::numeric_limits<double>::infinity(), decodes},
-        {"fa47c35000", 100000.0, decodes},
+        {"f97c00", std::numeric_limits<double>::infinity(), decodes}, {"fa47c35000", 100000.0, decodes},
         {"faff800000", -std::numeric_limits<double>::infinity(), decodes},
-        {"fb3ff199999999999a", 1.1},
-        {"fb3ff8000000000000", 1.5},
-        {"fb4000000000000000", 2.0},
-        {"f4", false},
-        {"f5", true},
-        {"f6", Value()},
-        {"63616263", "abc"},
-        {"60", ""},
-        {"64f09f9880", "\xF0\x9F\x98\x80"},
+        {"fb3ff199999999999a", 1.1}, {"fb3ff8000000000000", 1.5}, {"fb4000000000000000", 2.0},
+        {"f4", false}, {"f5", true}, {"f6", Value()},
+        {"63616263", "abc"}, {"60", ""}, {"64f09f9880", "\xF0\x9F\x98\x80"},
         {"780378797a", "xyz", decodes},  // not the shortest head: still fine
         {"7818" + repeated("78", 24), std::string(24, 'x')},
         {"79012c" + repeated("78", 300), std::string(300, 'x')},
-        {"43010203", Bytes{1, 2, 3}},
-        {"40", Bytes{}},
+        {"43010203", Bytes{1, 2, 3}}, {"40", Bytes{}},
         {"830161 61f6", Value(Array{Value(1u), Value("a"), Value()})},
-        {"80", Value(Array{})},
-        {"a0", Value(Dictionary{})},
+        {"80", Value(Array{})}, {"a0", Value(Dictionary{})},
         {"a2616202616182 01 a16163f5", Value(Dictionary{{"a", Value(Array{Value(1u), Value(Dictionary{{"c", true}})})}, {"b", 2u}}),
          decodes},  // keys in any order
         {"a2616180616201", Value(Dictionary{{"b", 1u}, {"a", Value(Array{})}})},
         // Dates: an integer when whole, else a double; any number decodes.
-        {"c11a514b67b0", Date{1363896240}},
-        {"c1fb41d452d9ec200000", Date{1363896240.5}},
-        {"c13863", Date{-100}},
+        {"c11a514b67b0", Date{1363896240}}, {"c1fb41d452d9ec200000", Date{1363896240.5}}, {"c13863", Date{-100}},
         {"c1fb7e37e43c8800759c", Date{1e300}},  // beyond int64
         {"c1f93e00", Date{1.5}, decodes},
         {"d80100", Date{0}, decodes},  // tag number in a one-byte head
@@ -230,85 +206,51 @@ TEST(CborCodec, ValuesAndTheirEncodings) {
 TEST(CborDecode, InvalidPayloadsAreRefusedWithTheirReason) {
     const std::pair<std::string, std::string> cases[] = {
         {"", "empty payload"},
-        {"3b8000000000000000", "negative integer below -2^63"},
-        {"3bffffffffffffffff", "negative integer below -2^63"},
+        {"3b8000000000000000", "negative integer below -2^63"}, {"3bffffffffffffffff", "negative integer below -2^63"},
         // indefinite lengths, and a break with nothing to end
-        {"9fff", "indefinite length"},
-        {"bfff", "indefinite length"},
-        {"5f4100ff", "indefinite length"},
-        {"7f6161ff", "indefinite length"},
-        {"819fff", "indefinite length"},
-        {"ff", "unexpected break"},
+        {"9fff", "indefinite length"}, {"bfff", "indefinite length"}, {"5f4100ff", "indefinite length"},
+        {"7f6161ff", "indefinite length"}, {"819fff", "indefinite length"}, {"ff", "unexpected break"},
         // map keys
-        {"a10102", "map key is not text"},
-        {"a1416102", "map key is not text"},
-        {"a18002", "map key is not text"},
-        {"a1f602", "map key is not text"},
-        {"a16161a10102", "map key is not text"},
-        {"81a1c10002", "map key is not text"},
-        {"a2617801617802", "duplicate map key \"x\""},
-        {"a3617901617802617903", "duplicate map key \"y\""},
+        {"a10102", "map key is not text"}, {"a1416102", "map key is not text"}, {"a18002", "map key is not text"},
+        {"a1f602", "map key is not text"}, {"a16161a10102", "map key is not text"}, {"81a1c10002", "map key is not text"},
+        {"a2617801617802", "duplicate map key \"x\""}, {"a3617901617802617903", "duplicate map key \"y\""},
         {"81a260016002", "duplicate map key \"\""},
-        // UTF-8
-        {"6180", "text is not UTF-8"},            // lone continuation byte
-        {"62c080", "text is not UTF-8"},          // overlong NUL
-        {"63e08080", "text is not UTF-8"},        // overlong three-byte
-        {"64f0808080", "text is not UTF-8"},      // overlong four-byte
-        {"63eda080", "text is not UTF-8"},        // surrogate U+D800
-        {"64f4908080", "text is not UTF-8"},      // U+110000
-        {"62e282", "text is not UTF-8"},          // cut short
-        {"61ff", "text is not UTF-8"},
-        {"a161fe01", "text is not UTF-8"},        // in a key
+        // UTF-8: a lone continuation byte, overlong NUL, overlong three- and
+        // four-byte forms, the surrogate U+D800, U+110000, cut short, 0xff, in a key
+        {"6180", "text is not UTF-8"}, {"62c080", "text is not UTF-8"}, {"63e08080", "text is not UTF-8"},
+        {"64f0808080", "text is not UTF-8"}, {"63eda080", "text is not UTF-8"}, {"64f4908080", "text is not UTF-8"},
+        {"62e282", "text is not UTF-8"}, {"61ff", "text is not UTF-8"}, {"a161fe01", "text is not UTF-8"},
         // simple values other than false, true and null
-        {"f7", "undefined is not supported"},
-        {"e0", "unsupported simple value (initial byte 0xe0)"},
-        {"f3", "unsupported simple value (initial byte 0xf3)"},
-        {"f820", "unsupported simple value (initial byte 0xf8)"},
+        {"f7", "undefined is not supported"}, {"e0", "unsupported simple value (initial byte 0xe0)"},
+        {"f3", "unsupported simple value (initial byte 0xf3)"}, {"f820", "unsupported simple value (initial byte 0xf8)"},
         // reserved additional information
-        {"1c", "reserved initial byte 0x1c"},
-        {"5d", "reserved initial byte 0x5d"},
+        {"1c", "reserved initial byte 0x1c"}, {"5d", "reserved initial byte 0x5d"},
         {"1f", "malformed item (initial byte 0x1f)"},
         // tags: only 1, 24 and 37, each on its own content
-        {"c24101", "unsupported tag 2"},
-        {"c060", "unsupported tag 0"},
-        {"c600", "unsupported tag 6"},
-        {"d9010000", "unsupported tag 256"},
-        {"dbffffffffffffffff00", "unsupported tag 18446744073709551615"},
-        {"c16131", "tag 1 content is not a number"},
-        {"c1f6", "tag 1 content is not a number"},
-        {"c180", "tag 1 content is not a number"},
-        {"c1c100", "tag 1 content is not a number"},
+        {"c24101", "unsupported tag 2"}, {"c060", "unsupported tag 0"}, {"c600", "unsupported tag 6"},
+        {"d9010000", "unsupported tag 256"}, {"dbffffffffffffffff00", "unsupported tag 18446744073709551615"},
+        {"c16131", "tag 1 content is not a number"}, {"c1f6", "tag 1 content is not a number"},
+        {"c180", "tag 1 content is not a number"}, {"c1c100", "tag 1 content is not a number"},
         {"c1f97e00", "tag 1 content is not a finite number"},
         {"d8254f" + repeated("00", 15), "tag 37 content is not a 16-byte byte string"},
         {"d82551" + repeated("00", 17), "tag 37 content is not a 16-byte byte string"},
         {"d82570" + repeated("61", 16), "tag 37 content is not a 16-byte byte string"},
-        {"d818a0", "tag 24 content is not a byte string"},
-        {"d8186161", "tag 24 content is not a byte string"},
-        {"d818420101", "trailing bytes in tag 24 content"},
-        {"d81840", "truncated item"},
+        {"d818a0", "tag 24 content is not a byte string"}, {"d8186161", "tag 24 content is not a byte string"},
+        {"d818420101", "trailing bytes in tag 24 content"}, {"d81840", "truncated item"},
         // The inner item may not reach past its byte string into the outer payload.
         {"82d818418101", "truncated item"},
-        {packedTag("a10102"), "map key is not text"},
-        {packedTag("9fff"), "indefinite length"},
+        {packedTag("a10102"), "map key is not text"}, {packedTag("9fff"), "indefinite length"},
         {packedTag("c24100"), "unsupported tag 2"},
         // truncation and trailing bytes
-        {"1901", "truncated item"},
-        {"6261", "truncated item"},
-        {"8201", "truncated item"},
-        {"a16161", "truncated item"},
-        {"c1", "truncated item"},
-        {"fb0000", "truncated item"},
-        {"0102", "trailing bytes"},
-        {"8000", "trailing bytes"},
-        {"f6f6", "trailing bytes"},
+        {"1901", "truncated item"}, {"6261", "truncated item"}, {"8201", "truncated item"}, {"a16161", "truncated item"},
+        {"c1", "truncated item"}, {"fb0000", "truncated item"},
+        {"0102", "trailing bytes"}, {"8000", "trailing bytes"}, {"f6f6", "trailing bytes"},
         // byte string, text, array and map of 2^60, and counts just past what the bytes could hold
         {"5b1000000000000000" + repeated("00", 64), "truncated item"},
         {"7b1000000000000000" + repeated("00", 64), "truncated item"},
         {"9b1000000000000000" + repeated("00", 64), "truncated item"},
         {"bb1000000000000000" + repeated("00", 64), "truncated item"},
-        {"9a7fffffff01", "truncated item"},
-        {"830102", "truncated item"},
-        {"a2616101", "truncated item"},
+        {"9a7fffffff01", "truncated item"}, {"830102", "truncated item"}, {"a2616101", "truncated item"},
     };
     gLargestAllocation = 0;
     for (const auto& [hexText, reason] : cases) {

@@ -231,23 +231,19 @@ TEST(PropertyList, BrokenOrHostileXmlIsRefusedWithoutCrashing) {
         unfinished += "<array>";
     }
     const std::pair<std::string, int> cases[] = {
-        {"", qm::plist::kErrorMalformed},
-        {"garbage", qm::plist::kErrorMalformed},
+        {"", qm::plist::kErrorMalformed}, {"garbage", qm::plist::kErrorMalformed}, {"bplist00", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><dict><key>a</key>", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><array><string>x</array></plist>", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><dict><integer>1</integer></dict></plist>", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><array><bogus/></array></plist>", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><array></dict></plist>", qm::plist::kErrorMalformed},
-        {"bplist00", qm::plist::kErrorMalformed},
         {xmlDocument("<array><string>ok</string><string>\xff\xfe</string></array>"), qm::plist::kErrorMalformed},
         {"<!DOCTYPE plist [ <!ENTITY x \"y\"> ]><plist version=\"1.0\"><array/></plist>", qm::plist::kErrorMalformed},
         {"<plist version=\"1>\"><array/></plist>", qm::plist::kErrorMalformed},
-        {nestedXml(qm::plist::kMaxNesting + 1), qm::plist::kErrorTooComplex},
-        {nestedXml(200000), qm::plist::kErrorTooComplex},
+        {nestedXml(qm::plist::kMaxNesting + 1), qm::plist::kErrorTooComplex}, {nestedXml(200000), qm::plist::kErrorTooComplex},
         // Closing tags hidden in comments do not make the nesting look shallower.
         {nestedXml(2000, "<!-- </array></array> -->"), qm::plist::kErrorTooComplex},
-        {unfinished, qm::plist::kErrorTooComplex},
-        {std::string(qm::plist::kMaxBytes + 1, ' '), qm::plist::kErrorTooComplex},
+        {unfinished, qm::plist::kErrorTooComplex}, {std::string(qm::plist::kMaxBytes + 1, ' '), qm::plist::kErrorTooComplex},
     };
     for (const auto& [document, code] : cases) {
         SCOPED_TRACE(document.substr(0, 80));

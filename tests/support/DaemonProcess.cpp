@@ -9,7 +9,6 @@
 
 #include <array>
 #include <filesystem>
-#include <thread>
 
 #include "support/Eventually.h"
 #include "support/FramePeer.h"
@@ -18,32 +17,27 @@ namespace qmtest {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
 // Starts the program with `extra` added to (or replacing) the test's own
 // environment, its standard streams on the given descriptors (-1: the test's).
 pid_t spawn(std::vector<std::string> argv, const std::map<std::string, std::string>& extra, std::array<int, 3> streams) {
-    std::map<std::string, std::string> all(extra);
-    for (char** e = environ; *e != nullptr; ++e) {
-        std::string entry(*e);
-        if (auto eq = entry.find('='); eq != std::string::npos) {
-            all.emplace(entry.substr(0, eq), entry.substr(eq + 1));
-        }
-    }
     std::vector<std::string> environment;
-    for (const auto& [k, v] : all) {
+    for (const auto& [k, v] : extra) {
         environment.push_back(k + "=" + v);
     }
-    auto pointers = [](std::vector<std::string>& strings) {
-        std::vector<char*> out;
-        for (auto& s : strings) {
-            out.push_back(s.data());
+    for (char** e = environ; *e != nullptr; ++e) {
+        if (std::string entry(*e); !extra.contains(entry.substr(0, entry.find('=')))) {
+            environment.push_back(entry);
         }
-        out.push_back(nullptr);
-        return out;
-    };
-    auto argp = pointers(argv);
-    auto envp = pointers(environment);
+    }
+    std::vector<char*> argp, envp;
+    for (auto& a : argv) {
+        argp.push_back(a.data());
+    }
+    for (auto& e : environment) {
+        envp.push_back(e.data());
+    }
+    argp.push_back(nullptr);
+    envp.push_back(nullptr);
     pid_t pid = ::fork();
     if (pid == 0) {
         for (int fd = 0; fd < 3; ++fd) {
@@ -57,17 +51,12 @@ pid_t spawn(std::vector<std::string> argv, const std::map<std::string, std::stri
     return pid;
 }
 
+// The wait status once the process has ended, or nothing after the timeout.
 std::optional<int> waitPid(pid_t pid, std::chrono::milliseconds timeout) {
-    for (auto deadline = Clock::now() + timeout;; std::this_thread::sleep_for(std::chrono::milliseconds(5))) {
-        int status = 0;
-        pid_t r = ::waitpid(pid, &status, WNOHANG);
-        if (r == pid) {
-            return status;
-        }
-        if (r < 0 || Clock::now() > deadline) {
-            return std::nullopt;
-        }
-    }
+    int status = 0;
+    pid_t ended = 0;
+    eventually([&] { return (ended = ::waitpid(pid, &status, WNOHANG)) != 0; }, timeout);
+    return ended == pid ? std::optional(status) : std::nullopt;
 }
 
 int openForWriting(const std::string& path) {
@@ -79,31 +68,21 @@ int openForWriting(const std::string& path) {
 DaemonProcess::DaemonProcess(std::vector<std::string> arguments, const std::map<std::string, std::string>& environment,
                              std::string serviceName)
     : serviceName_(std::move(serviceName)) {
-    std::map<std::string, std::string> env = {
-        {"QM_DUCT_DIR", scratch_.file("duct")},        {"QM_LOG_STDERR", "1"},
-        {"XDG_DATA_HOME", scratch_.file("data")},      {"XDG_CONFIG_HOME", scratch_.file("config")},
-        {"XDG_STATE_HOME", scratch_.file("state")},
-    };
-    for (const auto& [k, v] : environment) {
-        env[k] = v;
-    }
+    std::map<std::string, std::string> env = environment;
+    env.merge(std::map<std::string, std::string>{{"QM_DUCT_DIR", scratch_.file("duct")}, {"QM_LOG_STDERR", "1"},
+                                                 {"XDG_DATA_HOME", scratch_.file("data")},
+                                                 {"XDG_CONFIG_HOME", scratch_.file("config")},
+                                                 {"XDG_STATE_HOME", scratch_.file("state")}});
     runtimeDirectory_ = env["QM_DUCT_DIR"];
     logPath_ = scratch_.file("qmd.log");
     arguments.insert(arguments.begin(), {QMD_BINARY_PATH, "-S", serviceName_});
     int logFd = openForWriting(logPath_);
     pid_ = spawn(arguments, env, {-1, -1, logFd});
     ::close(logFd);
-    for (auto deadline = Clock::now() + std::chrono::seconds(10); Clock::now() < deadline;) {
-        if (FramePeer::canConnect(socketPath())) {
-            return;
-        }
-        if (!running()) {
-            ADD_FAILURE() << "qmd exited during start-up: " << log();
-            return;
-        }
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    eventually([&] { return FramePeer::canConnect(socketPath()) || !running(); }, std::chrono::seconds(10));
+    if (!FramePeer::canConnect(socketPath())) {
+        ADD_FAILURE() << "qmd did not listen within 10 s, or exited: " << log();
     }
-    ADD_FAILURE() << "qmd did not listen within 10 s: " << log();
 }
 
 DaemonProcess::~DaemonProcess() {
