@@ -21,23 +21,21 @@ TEST(DaemonClientE2E, ManyThreadsShareOneClientAndGetTheDaemonsRepliesAndRefusal
     auto client = QMDaemonClient::initWithServiceName(daemon.serviceName().c_str(), 5000ms);
     ASSERT_TRUE(client.ok()) << client.error().text();
     std::atomic<int> good{0};
-    std::vector<std::thread> threads;
-    for (int t = 0; t < 4; ++t) {
-        threads.emplace_back([&, t] {
-            for (int i = 0; i < 25; ++i) {
-                auto message = (*client)->request(i % 2 ? "bulk" : "x-unknown");
-                if (t == 3) {
-                    message.set("version", std::uint64_t{4});
+    {
+        std::vector<std::jthread> threads;
+        for (int t = 0; t < 4; ++t) {
+            threads.emplace_back([&, t] {
+                for (int i = 0; i < 25; ++i) {
+                    auto message = (*client)->request(i % 2 ? "bulk" : "x-unknown");
+                    if (t == 3) {
+                        message.set("version", std::uint64_t{4});
+                    }
+                    auto error = QMDaemonClient::errorInReply((*client)->sendAndWait(message, 10000ms));
+                    std::string expected = t == 3 ? "unsupported protocol version 4 (current 3)" : (i % 2 ? "" : "unrecognized request");
+                    good += (error ? error->text() : "") == expected && (!error || error->domain == "Quamber") ? 1 : 0;
                 }
-                auto error = QMDaemonClient::errorInReply((*client)->sendAndWait(message, 10000ms));
-                std::string expected = t == 3 ? "unsupported protocol version 4 (current 3)"
-                                              : (i % 2 ? "" : "unrecognized request");
-                good += (error ? error->text() : "") == expected && (!error || error->domain == "Quamber") ? 1 : 0;
-            }
-        });
-    }
-    for (auto& thread : threads) {
-        thread.join();
+            });
+        }
     }
     EXPECT_EQ(good.load(), 100);
     EXPECT_TRUE(daemon.waitForLog("bulk options 0x0 not supported"));

@@ -164,46 +164,43 @@ TEST_F(OfflineExamples, TheSystemVolumeIsDecidedByTheRootsThroughLinks) {
 }
 
 TEST(OfflineLayout, TheContainingApplicationComesFromThePlugInsFolder) {
-    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("/a/Foo.app/PlugIns/X.bundle"), "/a/Foo.app");
-    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("/a/Foo.app/Contents/PlugIns/X.xbun"), "/a/Foo.app");
-    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("/a/Foo/PlugIns/X.bundle"), std::nullopt);
-    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("/a/Foo.app/Other/X.bundle"), std::nullopt);
-    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("/a/Foo.app/X.bundle"), std::nullopt);
-    EXPECT_EQ(OfflinePlugIns::containingApplicationPath("X.bundle"), std::nullopt);
+    const std::pair<const char*, std::optional<std::string>> cases[] = {
+        {"/a/Foo.app/PlugIns/X.bundle", "/a/Foo.app"}, {"/a/Foo.app/Contents/PlugIns/X.xbun", "/a/Foo.app"},
+        {"/a/Foo/PlugIns/X.bundle", std::nullopt}, {"/a/Foo.app/Other/X.bundle", std::nullopt},
+        {"/a/Foo.app/X.bundle", std::nullopt}, {"X.bundle", std::nullopt},
+    };
+    for (const auto& [path, application] : cases) {
+        EXPECT_EQ(OfflinePlugIns::containingApplicationPath(path), application) << path;
+    }
 }
 
 TEST(OfflineLayout, DeclaredIdentifiersFollowTheCatalogsRule) {
-    using Ids = std::vector<std::string>;
-    EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(dict({{"MRBundleIdentifier", "b"},
-                                                        {"VTExtension", dict({{"VTExtensionAttributes",
-                                                                               dict({{"VTExtensionIdentifier", "n"}})}})}})),
-              Ids{"n"});
-    EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(dict({{"MRBundleIdentifier", "b"},
-                                                        {"Quamber", dict({{"Attributes",
-                                                                           dict({{"ovaro.identifier", "o"}})}})}})),
-              Ids{"o"});
-    EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(
-                  dict({{"MRBundleIdentifier", "b"},
-                        {"Quamber", dict({{"Multiple", dict({{"m1", dict({})}, {"m2", dict({})}})}})}})),
-              (Ids{"m1", "m2"}));
-    EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(dict({{"MRBundleIdentifier", "b"}, {"VTExtension", dict({})}})),
-              Ids{"b"});
-    EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(dict({{"VTExtension", dict({})}})), Ids{});
+    Value named = dict({{"VTExtensionAttributes", dict({{"VTExtensionIdentifier", "n"}})}});
+    const std::pair<Value, std::vector<std::string>> cases[] = {
+        {dict({{"MRBundleIdentifier", "b"}, {"VTExtension", named}}), {"n"}},
+        {dict({{"MRBundleIdentifier", "b"}, {"Quamber", dict({{"Attributes", dict({{"ovaro.identifier", "o"}})}})}}), {"o"}},
+        {dict({{"MRBundleIdentifier", "b"}, {"Quamber", dict({{"Multiple", dict({{"m1", dict({})}, {"m2", dict({})}})}})}}),
+         {"m1", "m2"}},
+        {dict({{"MRBundleIdentifier", "b"}, {"VTExtension", dict({})}}), {"b"}},
+        {dict({{"VTExtension", dict({})}}), {}},
+    };
+    for (const auto& [info, identifiers] : cases) {
+        EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(info), identifiers) << info.description();
+    }
 }
 
 TEST(OfflineLayout, TheHubProtocolVersionFollowsTheDaemonsRule) {
-    auto make = [](const Value& info, const char* path) {
-        return QMPlugInCore::initWithName("i", std::string(path), info, Value(), std::nullopt);
+    const std::tuple<Value, const char*, unsigned> cases[] = {
+        {dict({{"Quamber", dict({})}, {"VTExtension", dict({{"HubProtocolVersion", 3}})}}), "/p.bundle", 3},  // declared
+        {dict({{"Quamber", dict({})}}), "/p.xbun", 1},  // old style
+        {dict({{"VTExtension", dict({})}}), "/p.xbun", 2},
+        {dict({{"VTExtension", dict({{"HubProtocolVersion", Value(std::uint64_t{1} << 40)}})}}), "/p.bundle", 2},
     };
-    auto declared = make(dict({{"Quamber", dict({})}, {"VTExtension", dict({{"HubProtocolVersion", 3}})}}), "/p.bundle");
-    auto old = make(dict({{"Quamber", dict({})}}), "/p.xbun");
-    auto extension = make(dict({{"VTExtension", dict({})}}), "/p.xbun");
-    auto outOfRange = make(dict({{"VTExtension", dict({{"HubProtocolVersion", Value(std::uint64_t{1} << 40)}})}}), "/p.bundle");
-    ASSERT_TRUE(declared && old && extension && outOfRange);
-    EXPECT_EQ(OfflinePlugIns::hubProtocolVersionOf(*declared), 3u);
-    EXPECT_EQ(OfflinePlugIns::hubProtocolVersionOf(*old), 1u);
-    EXPECT_EQ(OfflinePlugIns::hubProtocolVersionOf(*extension), 2u);
-    EXPECT_EQ(OfflinePlugIns::hubProtocolVersionOf(*outOfRange), 2u);
+    for (const auto& [info, path, version] : cases) {
+        auto plugIn = QMPlugInCore::initWithName("i", std::string(path), info, Value(), std::nullopt);
+        ASSERT_TRUE(plugIn) << info.description();
+        EXPECT_EQ(OfflinePlugIns::hubProtocolVersionOf(*plugIn), version) << info.description();
+    }
 }
 
 }  // namespace

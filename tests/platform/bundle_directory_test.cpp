@@ -110,12 +110,11 @@ TEST(BundleDirectory, TheInfoDictionaryIsReadOnceAndSharedByCopiesAndThreads) {
     ASSERT_TRUE(bundle);
     BundleDirectory copy = *bundle;
     std::vector<std::optional<qm::Value>> seen(8);
-    std::vector<std::thread> threads;
-    for (std::size_t i = 0; i < seen.size(); ++i) {
-        threads.emplace_back([&, i] { seen[i] = (i % 2 ? copy : *bundle).infoDictionary(); });
-    }
-    for (auto& thread : threads) {
-        thread.join();
+    {
+        std::vector<std::jthread> threads;
+        for (std::size_t i = 0; i < seen.size(); ++i) {
+            threads.emplace_back([&, i] { seen[i] = (i % 2 ? copy : *bundle).infoDictionary(); });
+        }
     }
     for (const auto& info : seen) {
         ASSERT_TRUE(info);

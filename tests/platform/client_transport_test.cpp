@@ -84,26 +84,24 @@ TEST(ClientTransport, ConcurrentSendersGetUniqueIdsAndTheirOwnReplies) {
     constexpr int kThreads = 4;
     constexpr int kPerThread = 50;
     std::set<std::uint64_t> ids;
-    std::thread echo([&] {
-        for (int i = 0; i < kThreads * kPerThread; ++i) {
-            auto frame = pair.peer->receive();
-            ASSERT_TRUE(frame);
-            ids.insert(frame->id);
-            pair.peer->reply(frame->id, frame->body);  // echoes the message as its reply
-        }
-    });
-    std::vector<std::thread> senders;
-    for (int t = 0; t < kThreads; ++t) {
-        senders.emplace_back([&, t] {
-            for (int n = t * kPerThread; n < (t + 1) * kPerThread; ++n) {
-                pair.client->send(message(n), pair.outcomes.handler(n));
+    {
+        std::jthread echo([&] {
+            for (int i = 0; i < kThreads * kPerThread; ++i) {
+                auto frame = pair.peer->receive();
+                ASSERT_TRUE(frame);
+                ids.insert(frame->id);
+                pair.peer->reply(frame->id, frame->body);  // echoes the message as its reply
             }
         });
+        std::vector<std::jthread> senders;
+        for (int t = 0; t < kThreads; ++t) {
+            senders.emplace_back([&, t] {
+                for (int n = t * kPerThread; n < (t + 1) * kPerThread; ++n) {
+                    pair.client->send(message(n), pair.outcomes.handler(n));
+                }
+            });
+        }
     }
-    for (auto& s : senders) {
-        s.join();
-    }
-    echo.join();
     ASSERT_TRUE(pair.outcomes.waitForReplies(kThreads * kPerThread));
     EXPECT_EQ(ids.size(), static_cast<std::size_t>(kThreads * kPerThread));
     for (int n = 0; n < kThreads * kPerThread; ++n) {

@@ -32,22 +32,19 @@ TEST(SerialQueue, JobsFromManyThreadsRunOneAtATimeInEachThreadsOrder) {
     std::vector<std::pair<int, int>> ran;  // touched only on the queue
     std::atomic<int> concurrent{0};
     std::atomic<bool> overlapped{false};
-    std::vector<std::thread> submitters;
-    for (int t = 0; t < 4; ++t) {
-        submitters.emplace_back([&, t] {
-            for (int i = 0; i < 500; ++i) {
-                queue.async([&, t, i] {
-                    if (concurrent.fetch_add(1) != 0) {
-                        overlapped = true;
-                    }
-                    ran.emplace_back(t, i);
-                    concurrent.fetch_sub(1);
-                });
-            }
-        });
-    }
-    for (auto& s : submitters) {
-        s.join();
+    {
+        std::vector<std::jthread> submitters;
+        for (int t = 0; t < 4; ++t) {
+            submitters.emplace_back([&, t] {
+                for (int i = 0; i < 500; ++i) {
+                    queue.async([&, t, i] {
+                        overlapped = overlapped || concurrent.fetch_add(1) != 0;
+                        ran.emplace_back(t, i);
+                        concurrent.fetch_sub(1);
+                    });
+                }
+            });
+        }
     }
     queue.sync([] {});
     EXPECT_FALSE(overlapped);
@@ -144,12 +141,11 @@ TEST(SerialQueue, AnIdleInlineQueueRunsOnTheCallerAndABusyOneOnItsWorker) {
         secondRanOn = std::this_thread::get_id();
         order.push_back(2);
     });
-    std::thread releaser([&] {
+    std::jthread releaser([&] {
         std::this_thread::sleep_for(std::chrono::milliseconds(20));
         gate.released.set_value();
     });
     queue.sync([&] { order.push_back(3); });
-    releaser.join();
     holder.join();
     EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
     EXPECT_NE(secondRanOn, std::this_thread::get_id());
