@@ -1,5 +1,5 @@
-// The daemon side of the transport behind its listener, driven by raw socket
-// clients: fairness, reply backlogs, hang-ups, broken frames and the limit.
+// The daemon side of a connection against raw socket clients: fairness,
+// reply backlogs, hang-ups, broken frames and the frame limit.
 
 #include <gtest/gtest.h>
 
@@ -18,8 +18,8 @@ qm::Value numbered(int i) {
 class DuctTransport : public ::testing::Test {
 protected:
     qmtest::TransportServer server;
-    std::string socketPath = server.listen();
-    FramePeer client{socketPath};  // connection 0
+    qmtest::TransportServer::Peer& peer = server.connect();  // connection 0
+    FramePeer& client = peer.end;
 };
 
 TEST_F(DuctTransport, AtMostSixtyFourRequestsAreReadBeforeRepliesGoOut) {
@@ -49,7 +49,6 @@ TEST_F(DuctTransport, AtMostSixtyFourRequestsAreReadBeforeRepliesGoOut) {
 TEST_F(DuctTransport, ALargeReplyReachesASlowReaderWhole) {
     client.send(numbered(1));
     ASSERT_TRUE(server.waitForMessages(1));
-    EXPECT_EQ(server.connection(0)->pid(), ::getpid()) << "identified at accept";
     qm::Bytes blob(3 * 1024 * 1024);
     for (std::size_t i = 0; i < blob.size(); ++i) {
         blob[i] = static_cast<std::uint8_t>(i * 7);
@@ -75,7 +74,7 @@ TEST_F(DuctTransport, ABacklogBeyondFourMebibytesClosesTheConnection) {
     auto reason = server.invalidReason(0);
     ASSERT_TRUE(reason);
     EXPECT_NE(reason->find("backlog"), std::string::npos) << *reason;
-    EXPECT_FALSE(server.connection(0)->isValid());
+    EXPECT_FALSE(peer.connection->isValid());
 }
 
 TEST_F(DuctTransport, AHangUpIsReportedOnceAndRepliesAfterItAreDropped) {
@@ -103,14 +102,14 @@ TEST_F(DuctTransport, BrokenFramesCloseOnlyTheirOwnConnection) {
     int number = 0;
     for (const auto& [bytes, reason] : cases) {
         SCOPED_TRACE(reason);
-        FramePeer attacker(socketPath);
+        FramePeer& attacker = server.connect().end;
         ASSERT_TRUE(attacker.sendBytes(bytes));
         EXPECT_TRUE(attacker.waitForClose());
         EXPECT_EQ(server.invalidReason(++number), reason);
         client.send(numbered(number));
         ASSERT_TRUE(server.waitForMessages(static_cast<std::size_t>(number)));
     }
-    EXPECT_TRUE(server.connection(0)->isValid());
+    EXPECT_TRUE(peer.connection->isValid());
 }
 
 TEST_F(DuctTransport, FramesArePiecedTogetherUpToExactlyTheLimit) {

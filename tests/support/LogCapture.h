@@ -1,6 +1,7 @@
 #pragma once
 // Collects every system-log line written in this process while it lives.
 
+#include <algorithm>
 #include <mutex>
 #include <string>
 #include <string_view>
@@ -36,11 +37,8 @@ public:
     }
     bool contains(const std::string& needle) const { return text().find(needle) != std::string::npos; }
     std::size_t countContaining(const std::string& needle) const {
-        std::size_t count = 0;
-        for (const auto& line : lines()) {
-            count += line.find(needle) != std::string::npos ? 1 : 0;
-        }
-        return count;
+        auto all = lines();
+        return std::count_if(all.begin(), all.end(), [&](const auto& line) { return line.find(needle) != std::string::npos; });
     }
     // Waits up to five seconds for a line holding the text.
     bool waitFor(const std::string& needle) const {

@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
 #include <condition_variable>
 #include <functional>
@@ -48,13 +49,8 @@ public:
 
     qm::Result<qm::Value> reply(int tag) {
         std::lock_guard lock(mutex_);
-        for (const auto& [t, reply] : replies_) {
-            if (t == tag) {
-                return reply;
-            }
-        }
-        ADD_FAILURE() << "no reply for " << tag;
-        return qm::Error{"test", 0, "missing"};
+        auto it = std::find_if(replies_.begin(), replies_.end(), [&](const auto& entry) { return entry.first == tag; });
+        return it != replies_.end() ? it->second : qm::Result<qm::Value>(qm::Error{"test", 0, "no reply for " + std::to_string(tag)});
     }
     // The reply's value; null (and a failure) when it is an error.
     qm::Value value(int tag) {
@@ -65,9 +61,7 @@ public:
     std::vector<int> order() {
         std::lock_guard lock(mutex_);
         std::vector<int> tags;
-        for (const auto& entry : replies_) {
-            tags.push_back(entry.first);
-        }
+        std::transform(replies_.begin(), replies_.end(), std::back_inserter(tags), [](const auto& entry) { return entry.first; });
         return tags;
     }
     std::vector<qm::Error> events() {

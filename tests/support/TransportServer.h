@@ -1,9 +1,8 @@
 #pragma once
 // The daemon's side of the transport in process, for the transport's tests:
 // an event loop on its own thread with one receive budget, and connections
-// either adopted over socketpairs (the test holds the other end) or taken by
-// a listener. Every event is recorded with the number of its connection, in
-// the order the connections came.
+// adopted over socketpairs, whose other ends the test holds. Every event is
+// recorded with the number of its connection, in the order they came.
 
 #include <gtest/gtest.h>
 #include <sys/socket.h>
@@ -14,11 +13,9 @@
 #include <mutex>
 #include <thread>
 
-#include "platform/duct/Listener.h"
+#include "platform/duct/PeerConnection.h"
 #include "support/Eventually.h"
 #include "support/FramePeer.h"
-#include "support/ScopedEnvironment.h"
-#include "support/TempDir.h"
 
 namespace qmtest {
 
@@ -54,28 +51,20 @@ public:
         auto identity = qm::duct::capturePeerIdentity(
             near.get(), hangUpFirst ? qm::duct::PidfdSource::pidfdOpen : qm::duct::PidfdSource::socketOption);
         auto connection = qm::duct::PeerConnection::adopt(*loop_, std::move(near), std::move(identity), budget_, nullptr);
-        std::lock_guard lock(mutex_);
-        return peers_.emplace_back(Peer{serve(connection), std::move(far), connection});
-    }
-
-    // Listens as a service in a runtime directory of its own; its socket path.
-    std::string listen() {
-        environment_.emplace("QM_DUCT_DIR", dir_.file("duct"));
-        auto listener = qm::duct::Listener::create(*loop_, "transport.test", queue_, budget_);
-        EXPECT_TRUE(listener) << (listener ? "" : listener.error().text());
-        listener_ = std::move(listener).value();
-        listener_->setConnectionHandler([this](std::shared_ptr<qm::duct::PeerConnection> connection) {
+        std::lock_guard held(mutex_);
+        int number = static_cast<int>(peers_.size());
+        connection->setEventHandler([this, number](qm::duct::ConnectionEvent&& event) {
             std::lock_guard lock(mutex_);
-            serve(connection);
+            if (event.kind == qm::duct::ConnectionEvent::Kind::message) {
+                messages_.emplace_back(number, std::move(*event.message));
+            } else {
+                invalid_.emplace_back(number, event.reason);
+            }
         });
-        EXPECT_FALSE(listener_->resume());
-        return dir_.file("duct/transport.test");
+        connection->resume();
+        return peers_.emplace_back(Peer{number, std::move(far), connection});
     }
 
-    std::shared_ptr<qm::duct::PeerConnection> connection(int number) {
-        std::lock_guard lock(mutex_);
-        return connections_.at(static_cast<std::size_t>(number));
-    }
     std::size_t messageCount() {
         std::lock_guard lock(mutex_);
         return messages_.size();
@@ -87,9 +76,7 @@ public:
     std::vector<int> messageSenders() {
         std::lock_guard lock(mutex_);
         std::vector<int> senders;
-        for (const auto& entry : messages_) {
-            senders.push_back(entry.first);
-        }
+        std::transform(messages_.begin(), messages_.end(), std::back_inserter(senders), [](auto& m) { return m.first; });
         return senders;
     }
     // The first message from that connection (from any, by default).
@@ -100,10 +87,6 @@ public:
         qm::duct::IncomingMessage message = std::move(it->second);
         messages_.erase(it);
         return message;
-    }
-    void dropMessages() {
-        std::lock_guard lock(mutex_);
-        messages_.clear();
     }
     std::size_t invalidCount() {
         std::lock_guard lock(mutex_);
@@ -122,33 +105,12 @@ public:
     }
 
 private:
-    // Records the connection's events; the caller holds the mutex.
-    int serve(const std::shared_ptr<qm::duct::PeerConnection>& connection) {
-        int number = static_cast<int>(connections_.size());
-        connections_.push_back(connection);
-        connection->setEventHandler([this, number](qm::duct::ConnectionEvent&& event) {
-            std::lock_guard lock(mutex_);
-            if (event.kind == qm::duct::ConnectionEvent::Kind::message) {
-                messages_.emplace_back(number, std::move(*event.message));
-            } else {
-                invalid_.emplace_back(number, event.reason);
-            }
-        });
-        connection->resume();
-        return number;
-    }
-
-    TempDir dir_;
-    std::optional<ScopedEnvironment> environment_;
     std::unique_ptr<qm::EventLoop> loop_ = std::move(qm::EventLoop::create()).value();
     std::shared_ptr<qm::duct::ReceiveBudget> budget_;
     std::mutex mutex_;
     std::deque<Peer> peers_;
-    std::vector<std::shared_ptr<qm::duct::PeerConnection>> connections_;
     std::list<std::pair<int, qm::duct::IncomingMessage>> messages_;
     std::vector<std::pair<int, std::string>> invalid_;
-    qm::SerialQueue queue_{"transport.test"};  // runs the listener's jobs, which touch what is above
-    std::shared_ptr<qm::duct::Listener> listener_;
     std::thread thread_;
 };
 
