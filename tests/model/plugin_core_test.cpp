@@ -218,7 +218,10 @@ TEST(PlugInSetters, SettersRebuildTheLevelsAbove) {
 // Canonical values complete what the bundle declares, at every level; the
 // diagnosis then reports the first problem in its fixed order.
 TEST(PlugInCanonical, CanonicalValuesAndTheDiagnosis) {
-    Value standard42 = dict({{"ovaro.format", "standard"}, {"VTExtensionPointVersion", "4.2"}});
+    auto attributes = [](const char* version, const char* format = "standard") {
+        return dict({{"ovaro.format", format}, {"VTExtensionPointVersion", version}});
+    };
+    Value standard42 = attributes("4.2");
     Value objectClassAndShared = dict({{"VTExtensionProtocol", "VTObject"}, {"PrincipalClass", "VTObject"},
                                        {"Shared", array({"."})}, {"VTExtensionAttributes", standard42}});
     const char* missingProtocol = "missing \"VTExtensionProtocol\" key in Info.plist or SDK";
@@ -236,27 +239,19 @@ TEST(PlugInCanonical, CanonicalValuesAndTheDiagnosis) {
          newStyleInfo(dict({{"Shared", array({"Resources", "Help"})}})), objectClassAndShared, nullptr, kAppExtensionPath},
         {"an application extension keeps its protocol and class",
          newStyleInfo(dict({{"VTExtensionProtocol", "Mine"}, {"PrincipalClass", "VTObject"}})),
-         dict({{"VTExtensionProtocol", "Mine"}, {"PrincipalClass", "VTObject"}, {"Shared", array({"."})},
-               {"VTExtensionAttributes", standard42}}),
-         nullptr, kAppExtensionPath},
+         Value(objectClassAndShared.asDictionary()->changing("VTExtensionProtocol", "Mine")), nullptr, kAppExtensionPath},
         {"other plug-ins get no such defaults", newStyleInfo(dict({{"Shared", "Resources"}})),
          dict({{"Shared", "Resources"}, {"VTExtensionAttributes", standard42}}), missingProtocol},
         {"attributes get the format and the bundle's version",
          newStyleInfo(dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", dict({{"a", 1}})}})),
-         dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", Value(standard42.asDictionary()->changing("a", 1))}}),
-         nullptr},
+         dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", Value(standard42.asDictionary()->changing("a", 1))}}), nullptr},
         {"without any version the version is 1", dict({{"VTExtension", dict({{"VTExtensionProtocol", "P"}})}}),
-         dict({{"VTExtensionProtocol", "P"},
-               {"VTExtensionAttributes", dict({{"ovaro.format", "standard"}, {"VTExtensionPointVersion", "1"}})}}),
-         nullptr},
+         dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", attributes("1")}}), nullptr},
         {"a declared version is kept",
          newStyleInfo(dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", dict({{"VTExtensionPointVersion", "7"}})}})),
-         dict({{"VTExtensionProtocol", "P"},
-               {"VTExtensionAttributes", dict({{"ovaro.format", "standard"}, {"VTExtensionPointVersion", "7"}})}}),
-         nullptr},
+         dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", attributes("7")}}), nullptr},
         {"embedded code makes the format hybrid", newStyleInfo(dict({{"VTExtensionProtocol", "P"}, {"EmbeddedCode", false}})),
-         dict({{"VTExtensionProtocol", "P"}, {"EmbeddedCode", false},
-               {"VTExtensionAttributes", dict({{"ovaro.format", "hybrid"}, {"VTExtensionPointVersion", "4.2"}})}}),
+         dict({{"VTExtensionProtocol", "P"}, {"EmbeddedCode", false}, {"VTExtensionAttributes", attributes("4.2", "hybrid")}}),
          "hybrid plug-ins are not supported on this platform"},
         {"a multiplexed entry is canonical at every level and alone",
          newStyleInfo(dict({{"Multiple", dict({{"com.example.share", dict({})}, {"com.example.other", dict({})}})}})),
