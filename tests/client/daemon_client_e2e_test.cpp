@@ -26,12 +26,9 @@ TEST(DaemonClientE2E, ManyThreadsShareOneClientAndGetTheDaemonsRepliesAndRefusal
         for (int t = 0; t < 4; ++t) {
             threads.emplace_back([&, t] {
                 for (int i = 0; i < 25; ++i) {
-                    auto message = (*client)->request(i % 2 ? "bulk" : "x-unknown");
-                    if (t == 3) {
-                        message.set("version", std::uint64_t{4});
-                    }
+                    auto message = (*client)->request((i + t) % 2 ? "bulk" : "x-unknown");
                     auto error = QMDaemonClient::errorInReply((*client)->sendAndWait(message, 10000ms));
-                    std::string expected = t == 3 ? "unsupported protocol version 4 (current 3)" : (i % 2 ? "" : "unrecognized request");
+                    std::string expected = (i + t) % 2 ? "" : "unrecognized request";
                     good += (error ? error->text() : "") == expected && (!error || error->domain == "Quamber") ? 1 : 0;
                 }
             });

@@ -150,21 +150,17 @@ TEST_F(DaemonClient, AReplyThatNeverComesIsATimeoutForTheBlockingCall) {
     EXPECT_EQ(QMDaemonClient::errorInReply(reply)->code, 4);
 }
 
-TEST_F(DaemonClient, ADaemonThatHangsUpFailsEveryPendingAndLaterRequestAndIsLoggedOnce) {
+// What a lost connection does to pending and later requests is the
+// transport's test; the library logs it, once.
+TEST_F(DaemonClient, ADaemonThatHangsUpIsLoggedOnce) {
     connect();
     qmtest::LogCapture log;
-    for (int i = 0; i < 3; ++i) {
-        client_->bulkPlugins(0, replies_.handler(i));
-        ASSERT_TRUE(daemon_->receive());
-    }
+    client_->bulkPlugins(0, replies_.handler(0));
+    ASSERT_TRUE(daemon_->receive());
     daemon_->close();
     ASSERT_TRUE(log.waitFor("Communications error: connection invalid: daemon closed the connection"));
-    client_->bulkPlugins(0, replies_.handler(3));
-    ASSERT_TRUE(replies_.waitForReplies(4));
-    for (int i = 0; i < 4; ++i) {
-        auto error = QMDaemonClient::errorInReply(replies_.reply(i));
-        EXPECT_EQ(error.value_or(qm::Error{}).text(), "connection invalid: daemon closed the connection") << i;
-    }
+    client_->bulkPlugins(0, replies_.handler(1));
+    ASSERT_TRUE(replies_.waitForReplies(2));
     EXPECT_EQ(log.countContaining("Communications error"), 1u);
 }
 

@@ -81,7 +81,6 @@ TEST_F(OfflineExamples, OldStyleExtensionAndDataPlugInsAreValid) {
     EXPECT_EQ(legacy.plugIn->protocolSpec(), Value("LegacyImportProtocol"));
     EXPECT_EQ(legacy.plugIn->version(), Value("2.0"));
     EXPECT_EQ(at(legacy.plugIn->attributes(), {"VTExtensionPointName"}), Value("ovaro.import")) << "translated";
-    EXPECT_EQ(legacy.plugIn->hubProtocolVersion(), 1u);
     EXPECT_EQ(widget.plugIn->protocolSpec(), Value("VTObject"));
     EXPECT_EQ(at(widget.plugIn->plugInDictionary(), {"Shared"}), modeltest::array({"."}));
     EXPECT_EQ(at(widget.plugIn->plugInDictionary(), {"CleanTimeout"}), Value(10)) << "from its SDK";
@@ -98,7 +97,6 @@ TEST_F(OfflineExamples, AMultiplexedBundleYieldsEachOfItsPlugIns) {
     for (const OfflinePlugIn& filter : plugIns) {
         ASSERT_TRUE(filter.plugIn);
         EXPECT_EQ(filter.error, std::nullopt);
-        EXPECT_EQ(filter.plugIn->hubProtocolVersion(), 3u);
         EXPECT_EQ(filter.plugIn->containingPath(), kStudio) << "desktop-style layout";
         EXPECT_EQ(filter.dataContainerPath, dir.file("data") + "/ovaro/Containers/ovaro.example.studio.filters");
     }
