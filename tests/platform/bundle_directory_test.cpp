@@ -21,7 +21,8 @@ using qmtest::writePlist;
 std::string makeBundle(const qmtest::TempDir& dir, bool desktop = false) {
     std::string bundle = dir.file("Foo.app");
     std::string infoFolder = desktop ? bundle + "/Contents" : bundle;
-    writePlist(infoFolder + "/Info.plist", qm::Dictionary{{"MRBundleExecutable", "Foo"}, {"MRBundleIdentifier", "com.example.foo"}});
+    writePlist(infoFolder + "/Info.plist",
+               qm::Dictionary{{"MRBundleExecutable", "Foo"}, {"MRBundleIdentifier", "com.example.foo"}});
     qmtest::writeFile(infoFolder + (desktop ? "/Exec/Foo" : "/Foo"), "#!/bin/sh\n");
     return bundle;
 }
@@ -78,7 +79,8 @@ TEST(BundleDirectory, ExecutableNamesThatAreNotPlainFileNamesAreIgnored) {
     const qm::Value names[] = {"../../etc/passwd", "a/b", "..", "", 3, qm::Value()};
     for (std::size_t i = 0; i < std::size(names); ++i) {
         std::string bundle = dir.file("B" + std::to_string(i) + ".app");
-        writePlist(bundle + "/Info.plist", names[i].isNull() ? qm::Dictionary{} : qm::Dictionary{{"MRBundleExecutable", names[i]}});
+        writePlist(bundle + "/Info.plist",
+                   names[i].isNull() ? qm::Dictionary{} : qm::Dictionary{{"MRBundleExecutable", names[i]}});
         auto directory = BundleDirectory::atPath(bundle);
         ASSERT_TRUE(directory);
         EXPECT_FALSE(directory->executablePath()) << names[i].description();

@@ -8,6 +8,7 @@
 #include <limits>
 #include <string>
 #include <tuple>
+#include <vector>
 
 #include "platform/value/Json.h"
 
@@ -93,7 +94,7 @@ TEST(Json, RefusalsSayWhatAndWhere) {
         return text + "1" + std::string(513, '}');
     }();
     // {text, a part of the message, how the message ends}
-    const std::tuple<std::string, std::string, std::string> cases[] = {
+    std::vector<std::tuple<std::string, std::string, std::string>> cases = {
         {"", "unexpected end of input", "line 1, column 1"},
         {"[1,\n 2]\n x", "invalid literal; expected end of input", "line 3, column 2"},
         {"{a:1}", "object key - invalid literal; expected string literal", "line 1, column 2"},
@@ -116,6 +117,17 @@ TEST(Json, RefusalsSayWhatAndWhere) {
         {R"({"$uuid": 5})", "\"$uuid\" needs a UUID", "line 1, column 1"},
         {R"({"$date": "2001-02-29T00:00:00Z"})", "\"$date\" needs an RFC 3339 date-time", "line 1, column 1"},
     };
+    // Data and dates take only their canonical spelling.
+    for (const char* bad :
+         {"AAECAw", "AAECAw=", "AA=CAw==", "AAECA*==", "AB==", "AAB=", "A===", "====", " AAA", "AAA=\\n", "AAECAw==="}) {
+        cases.emplace_back(std::string(R"([{"$data": ")") + bad + "\"}]", "\"$data\" needs base64 text", "line 1, column 2");
+    }
+    for (const char* bad : {"2001-01-01", "2001-01-01T00:00:00", "2001-13-01T00:00:00Z", "2001-01-01T24:00:00Z",
+                            "2001-01-01T00:60:00Z", "2001-01-01T00:00:00.Z", "2001-01-01T00:00:00+1:00",
+                            "2001-01-01 00:00:00Z", "2001-01-01T00:00:00Zjunk"}) {
+        cases.emplace_back(std::string(R"({"$date": ")") + bad + "\"}", "\"$date\" needs an RFC 3339 date-time",
+                           "line 1, column 1");
+    }
     for (const auto& [text, reason, where] : cases) {
         auto result = json::parse(text);
         ASSERT_FALSE(result.ok()) << text << " gave " << result.value().description();
@@ -126,21 +138,6 @@ TEST(Json, RefusalsSayWhatAndWhere) {
         EXPECT_EQ(message.find("last read"), std::string::npos) << message;
     }
     EXPECT_TRUE(json::parse(std::string(512, '[') + std::string(512, ']')).ok());
-}
-
-TEST(Json, DataAndDatesTakeOnlyTheirCanonicalSpelling) {
-    for (const char* bad : {"AAECAw", "AAECAw=", "AA=CAw==", "AAECA*==", "AB==", "AAB=", "A===", "====", " AAA",
-                            "AAA=\\n", "AAECAw==="}) {
-        auto result = json::parse(std::string(R"([{"$data": ")") + bad + "\"}]");
-        EXPECT_EQ(result.ok() ? "accepted" : result.error().text(), "\"$data\" needs base64 text at line 1, column 2")
-            << bad;
-    }
-    for (const char* bad : {"2001-01-01", "2001-01-01T00:00:00", "2001-13-01T00:00:00Z", "2001-01-01T24:00:00Z",
-                            "2001-01-01T00:60:00Z", "2001-01-01T00:00:00.Z", "2001-01-01T00:00:00+1:00",
-                            "2001-01-01 00:00:00Z", "2001-01-01T00:00:00Zjunk"}) {
-        auto result = json::parse(std::string(R"({"$date": ")") + bad + "\"}");
-        EXPECT_FALSE(result.ok()) << bad;
-    }
 }
 
 TEST(Json, WrittenTextParsesBackToTheSameValue) {

@@ -28,10 +28,6 @@ qm::Bytes bytesOf(std::string_view text) {
     return qm::Bytes(text.begin(), text.end());
 }
 
-std::string textOf(const qm::Bytes& bytes) {
-    return std::string(bytes.begin(), bytes.end());
-}
-
 std::string xmlDocument(std::string_view body) {
     return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
            "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
@@ -186,7 +182,8 @@ TEST(PropertyList, BinaryKeepsFractionsOfSecondsXmlWritesWholeOnes) {
                                       std::pair{Value(Array{std::int64_t{-5}}), "<integer>-5</integer>"}}) {
         auto bytes = qm::plist::serialize(value, Format::xml);
         ASSERT_TRUE(bytes.ok());
-        EXPECT_NE(textOf(*bytes).find(text), std::string::npos) << textOf(*bytes);
+        std::string xml(bytes->begin(), bytes->end());
+        EXPECT_NE(xml.find(text), std::string::npos) << xml;
     }
 }
 
@@ -314,7 +311,6 @@ TEST(PropertyList, EveryTruncationOfAValidDocumentIsHandled) {
                 EXPECT_NE(prefix->type(), qm::ValueType::null);
             }
         }
-        EXPECT_EQ(roundTrip(value, format), value);
     }
 }
 

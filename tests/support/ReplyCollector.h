@@ -50,7 +50,8 @@ public:
     qm::Result<qm::Value> reply(int tag) {
         std::lock_guard lock(mutex_);
         auto it = std::find_if(replies_.begin(), replies_.end(), [&](const auto& entry) { return entry.first == tag; });
-        return it != replies_.end() ? it->second : qm::Result<qm::Value>(qm::Error{"test", 0, "no reply for " + std::to_string(tag)});
+        return it != replies_.end() ? it->second
+                                    : qm::Result<qm::Value>(qm::Error{"test", 0, "no reply for " + std::to_string(tag)});
     }
     // The reply's value; null (and a failure) when it is an error.
     qm::Value value(int tag) {

@@ -111,9 +111,12 @@ TEST(Qmkit, TheDaemonsRepliesAndRefusals) {
         {{"bulk", "--flags", "42"}, "", 0, "", "", "bulk options 0x2a not supported"},
         {{"--json", "bulk", "--flags", "0x10"}, "", 0, "{}\n", "", "bulk options 0x10 not supported"},
         {{"send", "-"}, "{\"request\": \"bulk\",\n \"flags\": 7}\n", 0, "{}\n", "", "bulk options 0x7 not supported"},
-        {{"send", "{\"request\": \"bulk\", \"version\": 1}"}, "", 1, "", "qmkit: unsupported protocol version 1 (current 3) (code 7)\n"},
+        {{"send", "{\"request\": \"bulk\", \"version\": 1}"}, "", 1, "",
+         "qmkit: unsupported protocol version 1 (current 3) (code 7)\n"},
         {{"send", "{\"request\": \"Add\"}"}, "", 1, "", unrecognized},
-        {{"--json", "send", "{\"request\": \"x-unknown\", \"uuids\": [{\"$uuid\": \"0d3c1f5e-8a51-4c7e-9f6b-2d7f1e0a9b34\"}]}"}, "",
+        {{"--json", "send",
+          "{\"request\": \"x-unknown\", \"uuids\": [{\"$uuid\": \"0d3c1f5e-8a51-4c7e-9f6b-2d7f1e0a9b34\"}]}"},
+         "",
          1, "{\n  \"error\": \"unrecognized request\",\n  \"errorcode\": 4\n}\n", unrecognized},
     };
     for (Case c : cases) {

@@ -72,7 +72,8 @@ TEST_F(QmkitInspect, ItsOutputAndExitStatus) {
         {{filters, "-i", "ovaro.example.studio.none"}, 1, {},
          "qmkit: plug-in ovaro.example.studio.none in " + filters +
              ": malformed plug-in dictionary in plug-in ovaro.example.studio.none at file://"},
-        {{kStudio + "Broken.bundle"}, 1, {}, "qmkit: unreadable Info dictionary in plug-in bundle at " + kStudio + "Broken.bundle: "},
+        {{kStudio + "Broken.bundle"}, 1, {},
+         "qmkit: unreadable Info dictionary in plug-in bundle at " + kStudio + "Broken.bundle: "},
         {{dir.file("Nowhere.bundle")}, 1, {}, "qmkit: no plug-in bundle at " + dir.file("Nowhere.bundle") + " (code 9)\n"},
         {{}, 2, {}, usage},
         {{"--frobnicate", share}, 2, {}, usage},
