@@ -264,35 +264,30 @@ TEST(PropertyList, HostileBinaryListsAreRefusedAndHonestOnesRead) {
     }
     exponential.push_back(kTrueObject);
     const qm::Bytes twoKeys{0xD2, 1, 2, 3, 3};
-    struct Case {
-        const char* what;
-        qm::Bytes list;
-        int code;  // 0: read as expected
-        Value expected = Value();
-    };
-    const Case cases[] = {
+    // {what, the list, the error code (0: read as the value)}
+    const std::tuple<const char*, qm::Bytes, int, Value> cases[] = {
         {"two references to one object", binaryList({arrayObject({1, 1}, 1), kTrueObject}, 1), 0, Value(Array{true, true})},
         {"14 references to one string", binaryList({arrayObject(std::vector<std::uint64_t>(14, 1), 1), {0x51, 'x'}}, 1), 0,
          Value(Array(14, Value("x")))},
         {"a plain key", binaryList({{0xD1, 1, 2}, {0x52, 'a', 'b'}, kTrueObject}, 1), 0, Value(Dictionary{{"ab", true}})},
-        {"a UID", binaryList({arrayObject({1}, 1), {0x80, 0x05}}, 1), qm::plist::kErrorUnsupported},
-        {"a key with NUL", binaryList({{0xD1, 1, 2}, {0x53, 'a', 0, 'b'}, kTrueObject}, 1), qm::plist::kErrorMalformed},
-        {"a UTF-16 key with NUL", binaryList({{0xD1, 1, 2}, {0x62, 0, 'a', 0, 0}, kTrueObject}, 1), qm::plist::kErrorMalformed},
-        {"a key twice", binaryList({twoKeys, {0x51, 'a'}, {0x51, 'a'}, kTrueObject}, 1), qm::plist::kErrorMalformed},
-        {"200000 levels", binaryList(deep, 4), qm::plist::kErrorTooComplex},
-        {"shared exponentially", binaryList(exponential, 1), qm::plist::kErrorTooComplex},
-        {"a cycle", binaryList({arrayObject({1}, 1), arrayObject({0}, 1)}, 1), qm::plist::kErrorMalformed},
-        {"a reference past the end", binaryList({arrayObject({7}, 1)}, 1), qm::plist::kErrorMalformed},
-        {"a top object past the end", binaryList({kTrueObject}, 1, 3), qm::plist::kErrorMalformed},
+        {"a UID", binaryList({arrayObject({1}, 1), {0x80, 0x05}}, 1), qm::plist::kErrorUnsupported, {}},
+        {"a key with NUL", binaryList({{0xD1, 1, 2}, {0x53, 'a', 0, 'b'}, kTrueObject}, 1), qm::plist::kErrorMalformed, {}},
+        {"a UTF-16 key with NUL", binaryList({{0xD1, 1, 2}, {0x62, 0, 'a', 0, 0}, kTrueObject}, 1), qm::plist::kErrorMalformed, {}},
+        {"a key twice", binaryList({twoKeys, {0x51, 'a'}, {0x51, 'a'}, kTrueObject}, 1), qm::plist::kErrorMalformed, {}},
+        {"200000 levels", binaryList(deep, 4), qm::plist::kErrorTooComplex, {}},
+        {"shared exponentially", binaryList(exponential, 1), qm::plist::kErrorTooComplex, {}},
+        {"a cycle", binaryList({arrayObject({1}, 1), arrayObject({0}, 1)}, 1), qm::plist::kErrorMalformed, {}},
+        {"a reference past the end", binaryList({arrayObject({7}, 1)}, 1), qm::plist::kErrorMalformed, {}},
+        {"a top object past the end", binaryList({kTrueObject}, 1, 3), qm::plist::kErrorMalformed, {}},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.what);
-        auto value = qm::plist::parse(c.list);
-        if (c.code == 0) {
+    for (const auto& [what, list, code, expected] : cases) {
+        SCOPED_TRACE(what);
+        auto value = qm::plist::parse(list);
+        if (code == 0) {
             ASSERT_TRUE(value.ok()) << value.error().text();
-            EXPECT_EQ(*value, c.expected);
+            EXPECT_EQ(*value, expected);
         } else {
-            expectRefused(value, c.code);
+            expectRefused(value, code);
         }
     }
 }

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <thread>
+#include <tuple>
 
 #include "support/DaemonProcess.h"
 #include "support/FramePeer.h"
@@ -25,14 +26,9 @@ bool startsWith(const std::string& text, const std::string& prefix) {
 
 // Runs without a daemon: help, version and every usage error.
 TEST(QmkitUsage, AnswersWithoutADaemon) {
-    struct Case {
-        std::vector<std::string> args;
-        int exitStatus;
-        std::string out;  // how standard output starts; empty: nothing
-        std::string err;  // how standard error starts; empty: nothing
-    };
+    // {arguments, exit status, how standard output starts and how standard error starts (empty: nothing)}
     const std::string kTooLarge = "is too large (at most 18446744073709551615)\n";
-    const Case cases[] = {
+    const std::tuple<std::vector<std::string>, int, std::string, std::string> cases[] = {
         {{"--help"}, 0, "usage: qmkit [-S service] [--json] [--timeout SECONDS] <command>", ""},
         {{"bulk", "--help"}, 0, "usage: qmkit [-S service] [--json] [--timeout SECONDS] bulk [--flags N]", ""},
         {{"send", "--help"}, 0, "usage: qmkit [-S service] [--json] [--timeout SECONDS] send JSON", ""},
@@ -61,12 +57,12 @@ TEST(QmkitUsage, AnswersWithoutADaemon) {
         {{"bulk", "--flags"}, 2, "", "qmkit: bulk: unexpected argument \"--flags\""},
         {{"bulk", "extra"}, 2, "", "qmkit: bulk: unexpected argument \"extra\""},
     };
-    for (const Case& c : cases) {
-        ProgramResult result = offline(c.args);
-        const std::string what = c.args.empty() ? "(no arguments)" : c.args.front() + " ...";
-        EXPECT_EQ(result.exitStatus, c.exitStatus) << what << ": " << result.err;
-        EXPECT_TRUE(startsWith(result.out, c.out)) << what << ": " << result.out;
-        EXPECT_TRUE(startsWith(result.err, c.err)) << what << ": " << result.err;
+    for (const auto& [args, exitStatus, out, err] : cases) {
+        ProgramResult result = offline(args);
+        const std::string what = args.empty() ? "(no arguments)" : args.front() + " ...";
+        EXPECT_EQ(result.exitStatus, exitStatus) << what << ": " << result.err;
+        EXPECT_TRUE(startsWith(result.out, out)) << what << ": " << result.out;
+        EXPECT_TRUE(startsWith(result.err, err)) << what << ": " << result.err;
     }
 }
 
