@@ -49,16 +49,11 @@ TEST(PlugInForm, ExportWritesEveryKeyThatHasAValueAndTheDescriptorSurvivesTheWir
     plugIn->setHubProtocolVersion(2);
     plugIn->setLastModified(-12345);
     plugIn->setOnSystemVolume(true);
+    // No annotations export as an empty dictionary.
     qm::Dictionary expected{
-        {"hubProtocolVersion", std::uint64_t{2}},
-        {"path", kPath},
-        {"systemResident", true},
-        {"identifier", "com.example.share"},
-        {"version", "2.5"},
-        {"info", plugIn->plugInDictionary()},
-        {"uuid", plugIn->uuid()->text()},
-        {"lastmodified", -12345},
-        {"annotations", dict({})},  // none export as an empty dictionary
+        {"hubProtocolVersion", std::uint64_t{2}}, {"path", kPath}, {"systemResident", true}, {"identifier", "com.example.share"},
+        {"version", "2.5"}, {"info", plugIn->plugInDictionary()}, {"uuid", plugIn->uuid()->text()}, {"lastmodified", -12345},
+        {"annotations", dict({})},
         {"bundleInfo", Value(plugIn->bundleInfoDictionary().asDictionary()->changing("MRBundleInfoPlistURL", std::nullopt))},
     };
     EXPECT_EQ(Value(plugIn->exportForm()), Value(expected));
@@ -69,10 +64,10 @@ TEST(PlugInForm, ExportWritesEveryKeyThatHasAValueAndTheDescriptorSurvivesTheWir
     plugIn->setLocalizedShortName("Share");
     plugIn->setLocalizedContainingName("Example");
     plugIn->setAnnotations(qm::Dictionary{{"election", 1}, {"extension", dict({{"k", "v"}})}});
-    expected.set("containingPath", "/apps/Example.app");
-    expected.set("localizedDisplayName", "Share to Example");
-    expected.set("localizedShortName", "Share");
-    expected.set("localizedContainingDisplayName", "Example");
+    for (const auto& [key, value] : {std::pair{"containingPath", "/apps/Example.app"}, {"localizedDisplayName", "Share to Example"},
+                                     {"localizedShortName", "Share"}, {"localizedContainingDisplayName", "Example"}}) {
+        expected.set(key, value);
+    }
     expected.set("annotations", dict({{"election", 1}, {"extension", dict({{"k", "v"}})}}));
     EXPECT_EQ(Value(plugIn->exportForm()), Value(expected));
 

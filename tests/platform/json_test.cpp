@@ -141,15 +141,9 @@ TEST(Json, RefusalsSayWhatAndWhere) {
 }
 
 TEST(Json, WrittenTextParsesBackToTheSameValue) {
-    Value value(Dictionary{
-        {"n", Value(std::int64_t{-7})},
-        {"u", Value(kU64Max)},
-        {"d", Value(0.30000000000000004)},
-        {"whole", Value(3.0)},
-        {"big", Value(1e14)},
-        {"s", Value("line\nbreak \"quoted\" \xE2\x82\xAC \x01")},
-        {"list", Value(Array{Value(), Value(true), Value(Array{Value(Dictionary{})})})},
-    });
+    Value value(Dictionary{{"n", std::int64_t{-7}}, {"u", kU64Max}, {"d", 0.30000000000000004}, {"whole", 3.0}, {"big", 1e14},
+                           {"s", "line\nbreak \"quoted\" \xE2\x82\xAC \x01"},
+                           {"list", Value(Array{Value(), Value(true), Value(Array{Value(Dictionary{})})})}});
     for (bool pretty : {false, true}) {
         auto back = json::parse(json::write(value, pretty));
         ASSERT_TRUE(back.ok()) << back.error().text();

@@ -65,11 +65,7 @@ TEST(SerialQueue, NestingsTheLockOrderAllowsNeverDeadlock) {
         SerialQueue z{"z", qm::QualityOfService::standard, /*runsInlineWhenIdle=*/true};
     };
     using Finish = std::function<void()>;
-    struct Nesting {
-        const char* name;
-        std::function<void(Queues&, Finish)> run;
-    };
-    const Nesting nestings[] = {
+    const std::pair<const char*, std::function<void(Queues&, Finish)>> nestings[] = {
         {"X.sync -> Y.async -> X.sync",
          [](Queues& q, Finish finish) { q.x.sync([&q, finish] { q.y.async([&q, finish] { q.x.sync(finish); }); }); }},
         {"X.async -> Y.async -> X.sync",
@@ -82,23 +78,25 @@ TEST(SerialQueue, NestingsTheLockOrderAllowsNeverDeadlock) {
              });
          }},
         {"X.sync -> Y.sync -> Z.async -> Y.sync",
-         [](Queues& q, Finish finish) { q.x.sync([&q, finish] { q.y.sync([&q, finish] { q.z.async([&q, finish] { q.y.sync(finish); }); }); }); }},
+         [](Queues& q, Finish finish) {
+             q.x.sync([&q, finish] { q.y.sync([&q, finish] { q.z.async([&q, finish] { q.y.sync(finish); }); }); });
+         }},
         {"X.async -> Y.sync -> X.async",
          [](Queues& q, Finish finish) { q.x.async([&q, finish] { q.y.sync([&q, finish] { q.x.async(finish); }); }); }},
     };
-    for (const Nesting& nesting : nestings) {
-        SCOPED_TRACE(nesting.name);
+    for (const auto& [name, run] : nestings) {
+        SCOPED_TRACE(name);
         Queues queues;
         std::promise<void> finished;
         auto ran = finished.get_future();
-        std::thread([&] { nesting.run(queues, [&] { finished.set_value(); }); }).detach();
+        std::thread([&, &run = run] { run(queues, [&] { finished.set_value(); }); }).detach();
         if (ran.wait_for(std::chrono::seconds(10)) != std::future_status::ready) {
-            std::fprintf(stderr, "deadlock: %s\n", nesting.name);
+            std::fprintf(stderr, "deadlock: %s\n", name);
             std::_Exit(1);
         }
-        queues.x.sync([] {});
-        queues.y.sync([] {});
-        queues.z.sync([] {});
+        for (SerialQueue* queue : {&queues.x, &queues.y, &queues.z}) {
+            queue->sync([] {});
+        }
     }
 }
 
