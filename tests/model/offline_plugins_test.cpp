@@ -69,6 +69,8 @@ TEST_F(OfflineExamples, ANewStylePlugInIsMergedWithItsSdkAndValid) {
     EXPECT_EQ(p.lastModified(), static_cast<std::int32_t>(status.st_mtim.tv_sec));
 }
 
+// How old-style names translate and what an extension gets by default are
+// the descriptor's tests; here the examples read from the disk are valid.
 TEST_F(OfflineExamples, OldStyleExtensionAndDataPlugInsAreValid) {
     OfflinePlugIn legacy = inspectOne(kNotesPlugIns + "LegacyImport.bundle");
     OfflinePlugIn widget = inspectOne(kNotesPlugIns + "NotesWidget.xbun");
@@ -77,14 +79,8 @@ TEST_F(OfflineExamples, OldStyleExtensionAndDataPlugInsAreValid) {
         ASSERT_TRUE(inspected->plugIn);
         EXPECT_EQ(inspected->error, std::nullopt) << inspected->error->text();
     }
-    EXPECT_EQ(legacy.plugIn->identifier(), "ovaro.example.notes.legacy");
     EXPECT_EQ(legacy.plugIn->protocolSpec(), Value("LegacyImportProtocol"));
-    EXPECT_EQ(legacy.plugIn->version(), Value("2.0"));
-    EXPECT_EQ(at(legacy.plugIn->attributes(), {"VTExtensionPointName"}), Value("ovaro.import")) << "translated";
-    EXPECT_EQ(widget.plugIn->protocolSpec(), Value("VTObject"));
-    EXPECT_EQ(at(widget.plugIn->plugInDictionary(), {"Shared"}), modeltest::array({"."}));
     EXPECT_EQ(at(widget.plugIn->plugInDictionary(), {"CleanTimeout"}), Value(10)) << "from its SDK";
-    EXPECT_EQ(at(widget.plugIn->attributes(), {"Size"}), Value("small"));
     EXPECT_TRUE(spelling.plugIn->isData());
     EXPECT_EQ(spelling.dataContainerPath, std::nullopt) << "a data plug-in needs no container";
 }
