@@ -1,4 +1,5 @@
-// The request envelope as a client sees it: versions, names, replies, logging.
+// The request envelope as a client sees it: versions, names, replies,
+// logging, and the wire format as another implementation speaks it.
 
 #include <gtest/gtest.h>
 
@@ -25,8 +26,7 @@ TEST(Protocol, EachRequestIsAnsweredInOrderOnceItsEnvelopeIsChecked) {
     // {message, error code (nothing: served, with an empty reply), error text}
     auto named = [](qm::Value name) { return request({{"request", name}, {"version", std::uint64_t{3}}}); };
     const std::tuple<qm::Value, std::optional<std::uint64_t>, const char*> cases[] = {
-        {bulk(3), std::nullopt, ""},
-        {bulk(2), std::nullopt, ""},
+        {bulk(3), std::nullopt, ""}, {bulk(2), std::nullopt, ""},
         {request({{"request", "bulk"}, {"version", std::int64_t{3}}}), std::nullopt, ""},  // the same number
         {request({{"request", "bulk"}, {"version", std::uint64_t{3}}, {"flags", std::uint64_t{0x1234500000abc}}}),
          std::nullopt, ""},
@@ -40,10 +40,8 @@ TEST(Protocol, EachRequestIsAnsweredInOrderOnceItsEnvelopeIsChecked) {
         {request({{"version", std::uint64_t{9}}}), 7, "unsupported protocol version 9 (current 3)"},
         {request({{"version", std::uint64_t{3}}}), 4, "invalid request format (missing type)"},
         {named(qm::Value(std::uint64_t{5})), 4, "invalid request format (missing type)"},
-        {named("Bulk"), 4, "unrecognized request"},
-        {named("BULK"), 4, "unrecognized request"},
-        {named("bulk "), 4, "unrecognized request"},
-        {named(""), 4, "unrecognized request"},
+        {named("Bulk"), 4, "unrecognized request"}, {named("BULK"), 4, "unrecognized request"},
+        {named("bulk "), 4, "unrecognized request"}, {named(""), 4, "unrecognized request"},
         {named("frobnicate"), 4, "unrecognized request"},
     };
     constexpr int kRounds = 12;
@@ -98,6 +96,16 @@ TEST(Protocol, VerbosityChoosesWhatIsLogged) {
         EXPECT_EQ(daemon.log().find(client + "used 1000 requests so far") != std::string::npos, debugLines);
         EXPECT_EQ(daemon.log().find(client + "used 999 "), std::string::npos);
     }
+}
+
+// The documented wire format, spoken by a client that shares no code with
+// ours: Python's cbor2 and a struct-packed frame header.
+TEST(WireFormat, AnIndependentPythonClientIsServed) {
+    DaemonProcess daemon;
+    auto result = qmtest::runProgram(
+        {QM_SYSTEM_PYTHON, std::string(QM_SOURCE_DIR) + "/tests/daemon/wire_client.py", daemon.socketPath()});
+    EXPECT_EQ(result.exitStatus, 0) << result.out << result.err;
+    EXPECT_EQ(result.out, "");
 }
 
 }  // namespace

@@ -26,12 +26,8 @@ namespace {
 TEST(Startup, TheCommandLine) {
     const std::string usage = "Usage: qmd [-S servicename] [-v]\n";
     const std::tuple<std::vector<std::string>, int, std::string, std::string> cases[] = {
-        {{"extra"}, 2, "", usage},
-        {{"-x"}, 2, "", "invalid option -- 'x'\n" + usage},
-        {{"-S"}, 2, "", usage},
-        {{"-v", "-d"}, 2, "", usage},
-        {{"-v", "--", "x"}, 2, "", usage},
-        {{"--version", "-v"}, 2, "", usage},
+        {{"extra"}, 2, "", usage}, {{"-x"}, 2, "", "invalid option -- 'x'\n" + usage}, {{"-S"}, 2, "", usage},
+        {{"-v", "-d"}, 2, "", usage}, {{"-v", "--", "x"}, 2, "", usage}, {{"--version", "-v"}, 2, "", usage},
         {{"--version"}, 0, std::string("qmd ") + QM_VERSION + "\n", ""},
         {{"--help"}, 0, "  -S name   the service name to listen on\n", ""},
     };

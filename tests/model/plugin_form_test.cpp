@@ -128,14 +128,13 @@ TEST(PlugInForm, AFormWithoutItsEssentialsSetsNothingUp) {
     ASSERT_TRUE(original);
     qm::Dictionary form = original->exportForm();
     LogCapture log;
-    EXPECT_FALSE(QMPlugInCore::initWithForm(Value(form.changing("path", std::nullopt))));
-    EXPECT_FALSE(QMPlugInCore::initWithForm(Value(form.changing("path", 42))));
-    EXPECT_FALSE(QMPlugInCore::initWithForm(Value(form.changing("identifier", std::nullopt))));
+    for (const Value& broken : {Value(form.changing("path", std::nullopt)), Value(form.changing("path", 42)),
+                                Value(form.changing("identifier", std::nullopt)), Value(form.changing("bundleInfo", std::nullopt)),
+                                Value(form.changing("bundleInfo", array({}))), Value("not a form")}) {
+        EXPECT_FALSE(QMPlugInCore::initWithForm(broken)) << broken.description();
+    }
     EXPECT_TRUE(log.contains("missing identifier in plug-in at " + kPath));
-    EXPECT_FALSE(QMPlugInCore::initWithForm(Value(form.changing("bundleInfo", std::nullopt))));
     EXPECT_TRUE(log.contains("missing Info dictionary in plug-in com.example.share at " + kPath));
-    EXPECT_FALSE(QMPlugInCore::initWithForm(Value(form.changing("bundleInfo", array({})))));
-    EXPECT_FALSE(QMPlugInCore::initWithForm(Value("not a form")));
 }
 
 TEST(PlugInForm, ANeverCanonicalizedDescriptorExportsNoVersion) {

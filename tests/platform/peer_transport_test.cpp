@@ -155,7 +155,7 @@ TEST(PeerTransport, AReplyTooLargeToSendLeavesTheRequestForASmallerOne) {
     EXPECT_EQ(reply->body, Value(qm::Dictionary{{"errorcode", 4}}));
 }
 
-TEST(PeerTransport, IdentityIsFixedAtAcceptOrNotAtAll) {
+TEST(PeerTransport, IdentityIsFixedAtAcceptOrNotAtAllAndWithoutItNothingIsServed) {
     // {source, hung up before the identity is taken, identified}
     const std::tuple<PidfdSource, bool, bool> cases[] = {
         {PidfdSource::socketOption, false, true},
@@ -182,9 +182,7 @@ TEST(PeerTransport, IdentityIsFixedAtAcceptOrNotAtAll) {
             EXPECT_NE(identity->executablePath->find("platform_peer_transport"), std::string::npos);
         }
     }
-}
-
-TEST(PeerTransport, AConnectionWithoutIdentityDeliversOnlyItsInvalidity) {
+    // A connection without one delivers nothing but its invalidity.
     Server server;
     auto& peer = server.connect(request(1, 10), /*hangUpFirst=*/true);
     EXPECT_FALSE(peer.connection->identity());
@@ -194,6 +192,7 @@ TEST(PeerTransport, AConnectionWithoutIdentityDeliversOnlyItsInvalidity) {
     EXPECT_EQ(server.invalidCount(), 1u);
     EXPECT_EQ(peer.connection->pid(), ::getpid());
 }
+
 
 // --- against raw socket clients ----------------------------------------------
 
