@@ -87,12 +87,19 @@ TEST(SerialQueue, NestingsTheLockOrderAllowsNeverDeadlock) {
     for (const auto& [name, run] : nestings) {
         SCOPED_TRACE(name);
         Queues queues;
-        std::promise<void> finished;
-        auto ran = finished.get_future();
-        std::thread([&, &run = run] { run(queues, [&] { finished.set_value(); }); }).detach();
-        if (ran.wait_for(std::chrono::seconds(10)) != std::future_status::ready) {
-            std::fprintf(stderr, "deadlock: %s\n", name);
-            std::_Exit(1);
+        // The queues go only once the nesting has returned: the thread that
+        // ran it inline still touches them after the innermost job.
+        std::promise<void> finished, returned;
+        std::future<void> waits[] = {finished.get_future(), returned.get_future()};
+        std::thread([&, &run = run] {
+            run(queues, [&] { finished.set_value(); });
+            returned.set_value();
+        }).detach();
+        for (auto& wait : waits) {
+            if (wait.wait_for(std::chrono::seconds(10)) != std::future_status::ready) {
+                std::fprintf(stderr, "deadlock: %s\n", name);
+                std::_Exit(1);
+            }
         }
         for (SerialQueue* queue : {&queues.x, &queues.y, &queues.z}) {
             queue->sync([] {});
@@ -153,8 +160,8 @@ TEST(SerialQueue, AnIdleInlineQueueRunsOnTheCallerAndABusyOneOnItsWorker) {
 TEST(SerialQueue, PendingJobsRunBeforeTheQueueGoes) {
     std::atomic<int> count{0};
     {
+        Gate gate;  // outlives the queue, whose worker waits on it
         SerialQueue queue("drain");
-        Gate gate;
         queue.async([&] { gate.enterAndWait(); });
         gate.in.wait();
         for (int i = 0; i < 100; ++i) {
