@@ -33,14 +33,11 @@ class Discovery : public ::testing::Test {
 protected:
     Discovery() {
         fs::copy(fs::path(QM_SOURCE_DIR) / "examples/Applications", roots.file("system"), fs::copy_options::recursive);
-        qmd = std::make_unique<qmtest::DaemonProcess>(options());
+        qmd = std::make_unique<qmtest::DaemonProcess>(
+            std::vector<std::string>{"-v"},
+            std::map<std::string, std::string>{{"QM_SYSTEM_ROOTS", roots.file("system")},
+                                               {"QM_SDK_PATH", std::string(QM_SOURCE_DIR) + "/examples/SDKs"}});
         client = std::make_unique<qmtest::FramePeer>(qmd->socketPath());
-    }
-    qmtest::DaemonOptions options() {
-        qmtest::DaemonOptions options = qmtest::withEnvironment(
-            {{"QM_SYSTEM_ROOTS", roots.file("system")}, {"QM_SDK_PATH", std::string(QM_SOURCE_DIR) + "/examples/SDKs"}});
-        options.arguments = {"-v"};
-        return options;
     }
     Value send(std::initializer_list<Dictionary::Entry> entries) {
         Dictionary request(entries);

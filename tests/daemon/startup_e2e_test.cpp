@@ -9,11 +9,11 @@
 
 #include <csignal>
 #include <thread>
+#include <tuple>
 
 #include "support/DaemonProcess.h"
 #include "support/FramePeer.h"
 
-using qmtest::DaemonOptions;
 using qmtest::DaemonProcess;
 using qmtest::FramePeer;
 using qmtest::bulk;
@@ -21,31 +21,23 @@ using qmtest::runProgram;
 
 namespace {
 
-const char kUsage[] = "Usage: qmd [-S servicename] [-v]\n";
-
-TEST(Startup, BadCommandLinesPrintTheUsageAndExitTwo) {
-    qmtest::TempDir dir;
-    std::map<std::string, std::string> env = {{"QM_DUCT_DIR", dir.file("duct")}};
-    for (auto args : std::vector<std::vector<std::string>>{{"extra"}, {"-x"}, {"-S"}, {"-v", "-d"}, {"-v", "--", "x"}}) {
+// Bad usage prints the usage line last (getopt's own diagnostic may come
+// first) and exits 2; --help and --version only as the only argument.
+TEST(Startup, TheCommandLine) {
+    const std::string usage = "Usage: qmd [-S servicename] [-v]\n";
+    const std::tuple<std::vector<std::string>, int, std::string, std::string> cases[] = {
+        {{"extra"}, 2, "", usage}, {{"-x"}, 2, "", "invalid option -- 'x'\n" + usage}, {{"-S"}, 2, "", usage},
+        {{"-v", "-d"}, 2, "", usage}, {{"-v", "--", "x"}, 2, "", usage}, {{"--version", "-v"}, 2, "", usage},
+        {{"--version"}, 0, std::string("qmd ") + QM_VERSION + "\n", ""},
+        {{"--help"}, 0, "  -S name   the service name to listen on\n", ""},
+    };
+    for (auto [args, exitStatus, out, err] : cases) {
         args.insert(args.begin(), QMD_BINARY_PATH);
-        auto result = runProgram(args, env);
-        EXPECT_EQ(result.exitStatus, 2) << args[1];
-        ASSERT_GE(result.err.size(), sizeof kUsage - 1);
-        // getopt's own diagnostic may come first; the usage line closes it exactly.
-        EXPECT_EQ(result.err.substr(result.err.size() - (sizeof kUsage - 1)), kUsage) << args[1];
+        auto result = runProgram(args, {{"QM_DUCT_DIR", "/nonexistent"}});
+        EXPECT_EQ(result.exitStatus, exitStatus) << args[1];
+        EXPECT_NE(result.out.find(out), std::string::npos) << result.out;
+        EXPECT_TRUE(result.err.ends_with(err)) << result.err;
     }
-    auto unknown = runProgram({QMD_BINARY_PATH, "-x"}, env);
-    EXPECT_NE(unknown.err.find("invalid option"), std::string::npos) << unknown.err;
-}
-
-TEST(Startup, InformationalOptionsPrintAndExitZero) {
-    auto version = runProgram({QMD_BINARY_PATH, "--version"});
-    EXPECT_EQ(version.exitStatus, 0);
-    EXPECT_EQ(version.out, std::string("qmd ") + QM_VERSION + "\n");
-    auto help = runProgram({QMD_BINARY_PATH, "--help"});
-    EXPECT_EQ(help.exitStatus, 0);
-    EXPECT_NE(help.out.find("-S name"), std::string::npos) << help.out;
-    EXPECT_EQ(runProgram({QMD_BINARY_PATH, "--version", "-v"}).exitStatus, 2) << "only as the only argument";
 }
 
 // Every refusal at start names its cause on standard error (no QM_LOG_STDERR
@@ -58,31 +50,25 @@ TEST(Startup, RefusalsAtStartNameTheirCauseAndChangeNothing) {
         ASSERT_EQ(::mkdir(path.c_str(), 0700), 0);
         ASSERT_EQ(::chmod(path.c_str(), mode), 0);
     }
-    struct Case {
-        std::vector<std::string> arguments;
-        std::map<std::string, std::string> environment;
-        std::string says;
-    };
+    // {arguments, environment, what standard error says}
     std::string duct = dir.file("duct");
-    const Case cases[] = {
+    std::vector<std::tuple<std::vector<std::string>, std::map<std::string, std::string>, std::string>> cases = {
         {{"-S", ""}, {{"QM_DUCT_DIR", duct}}, "invalid service name"},
         {{"-S", "a/b"}, {{"QM_DUCT_DIR", duct}}, "invalid service name"},
         {{}, {{"QM_DUCT_DIR", dir.file("notadir")}}, "is not a directory"},
         {{}, {{"QM_DUCT_DIR", dir.file("mode493")}}, dir.file("mode493") + " has mode 0755"},
         {{}, {{"QM_DUCT_DIR", dir.file("mode1023")}}, dir.file("mode1023") + " has mode 1777"},
         {{}, {{"QM_DUCT_DIR", dir.file("mode456")}}, "has mode 0710"},
-        {{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", "abc"}}, "QM_IDLE_EXIT"},
-        {{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", "0"}}, "QM_IDLE_EXIT"},
-        {{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", "-5"}}, "QM_IDLE_EXIT"},
-        {{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", " 5"}}, "QM_IDLE_EXIT"},
-        {{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", "99999999999"}}, "QM_IDLE_EXIT"},
     };
-    for (const Case& c : cases) {
+    for (const char* idle : {"abc", "0", "-5", " 5", "99999999999"}) {
+        cases.push_back({{}, {{"QM_DUCT_DIR", duct}, {"QM_IDLE_EXIT", idle}}, "QM_IDLE_EXIT"});
+    }
+    for (const auto& [arguments, environment, says] : cases) {
         std::vector<std::string> argv{QMD_BINARY_PATH};
-        argv.insert(argv.end(), c.arguments.begin(), c.arguments.end());
-        auto result = runProgram(argv, c.environment);
-        EXPECT_EQ(result.exitStatus, 1) << c.says;
-        EXPECT_NE(result.err.find(c.says), std::string::npos) << result.err;
+        argv.insert(argv.end(), arguments.begin(), arguments.end());
+        auto result = runProgram(argv, environment);
+        EXPECT_EQ(result.exitStatus, 1) << says;
+        EXPECT_NE(result.err.find(says), std::string::npos) << result.err;
         EXPECT_NE(result.err.find("unable to construct server"), std::string::npos) << result.err;
     }
     for (mode_t mode : {0755, 01777, 0710}) {
@@ -92,25 +78,20 @@ TEST(Startup, RefusalsAtStartNameTheirCauseAndChangeNothing) {
     }
 }
 
-TEST(Startup, TheRuntimeDirectoryAndSocketArePrivate) {
-    DaemonProcess daemon;
+TEST(Startup, TheServiceIsPrivateAndASecondDaemonOnItsNameLeavesTheFirstAlone) {
+    DaemonProcess first;
     struct stat dirInfo{};
     struct stat sockInfo{};
-    ASSERT_EQ(::stat(daemon.runtimeDirectory().c_str(), &dirInfo), 0);
-    ASSERT_EQ(::stat(daemon.socketPath().c_str(), &sockInfo), 0);
+    ASSERT_EQ(::stat(first.runtimeDirectory().c_str(), &dirInfo), 0);
+    ASSERT_EQ(::stat(first.socketPath().c_str(), &sockInfo), 0);
     EXPECT_EQ(dirInfo.st_mode & 07777, 0700u);
     EXPECT_EQ(sockInfo.st_mode & 07777, 0600u);
     EXPECT_TRUE(S_ISSOCK(sockInfo.st_mode));
-}
-
-TEST(Startup, ASecondDaemonOnTheSameNameLeavesTheFirstAlone) {
-    DaemonProcess first;
     auto result = runProgram({QMD_BINARY_PATH, "-S", first.serviceName()},
                              {{"QM_DUCT_DIR", first.runtimeDirectory()}, {"QM_LOG_STDERR", "1"}});
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_NE(result.err.find("service already running on " + first.socketPath()), std::string::npos) << result.err;
-    FramePeer client(first.socketPath());
-    EXPECT_TRUE(client.roundTrip(bulk()));
+    EXPECT_TRUE(FramePeer(first.socketPath()).roundTrip(bulk()));
 }
 
 TEST(Startup, AStaleSocketFileIsReplaced) {
@@ -119,9 +100,7 @@ TEST(Startup, AStaleSocketFileIsReplaced) {
     ASSERT_EQ(::mkdir(duct.c_str(), 0700), 0);
     std::string path = duct + "/stale.qmd";
     FramePeer::listenAt(path);  // closed at once: nobody answers there
-    DaemonOptions options = qmtest::withEnvironment({{"QM_DUCT_DIR", duct}});
-    options.serviceName = "stale.qmd";
-    DaemonProcess daemon(options);
+    DaemonProcess daemon({}, {{"QM_DUCT_DIR", duct}}, "stale.qmd");
     FramePeer client(path);
     EXPECT_TRUE(client.roundTrip(bulk()));
 }
@@ -164,7 +143,7 @@ void expectOrderlyExit(DaemonProcess& daemon, const std::string& line) {
 
 TEST(Startup, TerminationSignalsEndTheDaemonInOrder) {
     for (auto [signal, name] : {std::pair{SIGTERM, "SIGTERM"}, std::pair{SIGINT, "SIGINT"}}) {
-        DaemonProcess daemon(qmtest::withArguments({"-v"}));
+        DaemonProcess daemon({"-v"});
         EXPECT_TRUE(daemon.waitForLog("listening on " + daemon.socketPath()));
         FramePeer client(daemon.socketPath());
         ASSERT_TRUE(client.roundTrip(bulk()));
@@ -174,7 +153,7 @@ TEST(Startup, TerminationSignalsEndTheDaemonInOrder) {
 }
 
 TEST(Startup, AnIdleDaemonExitsButNotUnderAConnectedClient) {
-    DaemonProcess daemon(qmtest::withEnvironment({{"QM_IDLE_EXIT", "1"}}));
+    DaemonProcess daemon({}, {{"QM_IDLE_EXIT", "1"}});
     {
         FramePeer client(daemon.socketPath());
         ASSERT_TRUE(client.roundTrip(bulk()));

@@ -43,14 +43,13 @@ def main(path):
         "packed": cbor2.CBORTag(24, cbor2.dumps([{"a": 1}, "b"])),
         "negative": -5, "real": 1.5, "data": b"\x00\x01", "flag": True, "nothing": None,
     }
-    failures = []
+    failed = False
     for message_id, message in ((7, {"request": "bulk", "version": 3}), (2**63 + 5, rich)):
         answer = round_trip(sock, message_id, message)
         if answer != (2, message_id, {}):
-            failures.append("%r answered with %r" % (message, answer))
-    for failure in failures:
-        print("FAILED:", failure)
-    return 1 if failures else 0
+            print("FAILED: %r answered with %r" % (message, answer))
+            failed = True
+    return 1 if failed else 0
 
 
 if __name__ == "__main__":

@@ -30,16 +30,12 @@ inline qm::Value array(std::initializer_list<qm::Value> elements) {
 }
 
 // The value at a path of dictionary keys, or null.
-inline qm::Value at(const qm::Value& value, std::initializer_list<const char*> keys) {
-    qm::Value current = value;
+inline qm::Value at(qm::Value value, std::initializer_list<const char*> keys) {
     for (const char* key : keys) {
-        const qm::Value* next = current.get(key);
-        if (next == nullptr) {
-            return qm::Value();
-        }
-        current = *next;
+        const qm::Value* next = value.get(key);
+        value = next ? *next : qm::Value();
     }
-    return current;
+    return value;
 }
 
 }  // namespace modeltest

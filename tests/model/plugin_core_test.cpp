@@ -3,6 +3,8 @@
 
 #include <gtest/gtest.h>
 
+#include <tuple>
+
 #include "ModelTestSupport.h"
 #include "model/QMError.h"
 #include "model/QMPlugInCore.h"
@@ -216,7 +218,10 @@ TEST(PlugInSetters, SettersRebuildTheLevelsAbove) {
 // Canonical values complete what the bundle declares, at every level; the
 // diagnosis then reports the first problem in its fixed order.
 TEST(PlugInCanonical, CanonicalValuesAndTheDiagnosis) {
-    Value standard42 = dict({{"ovaro.format", "standard"}, {"VTExtensionPointVersion", "4.2"}});
+    auto attributes = [](const char* version, const char* format = "standard") {
+        return dict({{"ovaro.format", format}, {"VTExtensionPointVersion", version}});
+    };
+    Value standard42 = attributes("4.2");
     Value objectClassAndShared = dict({{"VTExtensionProtocol", "VTObject"}, {"PrincipalClass", "VTObject"},
                                        {"Shared", array({"."})}, {"VTExtensionAttributes", standard42}});
     const char* missingProtocol = "missing \"VTExtensionProtocol\" key in Info.plist or SDK";
@@ -234,27 +239,19 @@ TEST(PlugInCanonical, CanonicalValuesAndTheDiagnosis) {
          newStyleInfo(dict({{"Shared", array({"Resources", "Help"})}})), objectClassAndShared, nullptr, kAppExtensionPath},
         {"an application extension keeps its protocol and class",
          newStyleInfo(dict({{"VTExtensionProtocol", "Mine"}, {"PrincipalClass", "VTObject"}})),
-         dict({{"VTExtensionProtocol", "Mine"}, {"PrincipalClass", "VTObject"}, {"Shared", array({"."})},
-               {"VTExtensionAttributes", standard42}}),
-         nullptr, kAppExtensionPath},
+         Value(objectClassAndShared.asDictionary()->changing("VTExtensionProtocol", "Mine")), nullptr, kAppExtensionPath},
         {"other plug-ins get no such defaults", newStyleInfo(dict({{"Shared", "Resources"}})),
          dict({{"Shared", "Resources"}, {"VTExtensionAttributes", standard42}}), missingProtocol},
         {"attributes get the format and the bundle's version",
          newStyleInfo(dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", dict({{"a", 1}})}})),
-         dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", Value(standard42.asDictionary()->changing("a", 1))}}),
-         nullptr},
+         dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", Value(standard42.asDictionary()->changing("a", 1))}}), nullptr},
         {"without any version the version is 1", dict({{"VTExtension", dict({{"VTExtensionProtocol", "P"}})}}),
-         dict({{"VTExtensionProtocol", "P"},
-               {"VTExtensionAttributes", dict({{"ovaro.format", "standard"}, {"VTExtensionPointVersion", "1"}})}}),
-         nullptr},
+         dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", attributes("1")}}), nullptr},
         {"a declared version is kept",
          newStyleInfo(dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", dict({{"VTExtensionPointVersion", "7"}})}})),
-         dict({{"VTExtensionProtocol", "P"},
-               {"VTExtensionAttributes", dict({{"ovaro.format", "standard"}, {"VTExtensionPointVersion", "7"}})}}),
-         nullptr},
+         dict({{"VTExtensionProtocol", "P"}, {"VTExtensionAttributes", attributes("7")}}), nullptr},
         {"embedded code makes the format hybrid", newStyleInfo(dict({{"VTExtensionProtocol", "P"}, {"EmbeddedCode", false}})),
-         dict({{"VTExtensionProtocol", "P"}, {"EmbeddedCode", false},
-               {"VTExtensionAttributes", dict({{"ovaro.format", "hybrid"}, {"VTExtensionPointVersion", "4.2"}})}}),
+         dict({{"VTExtensionProtocol", "P"}, {"EmbeddedCode", false}, {"VTExtensionAttributes", attributes("4.2", "hybrid")}}),
          "hybrid plug-ins are not supported on this platform"},
         {"a multiplexed entry is canonical at every level and alone",
          newStyleInfo(dict({{"Multiple", dict({{"com.example.share", dict({})}, {"com.example.other", dict({})}})}})),
@@ -305,26 +302,22 @@ TEST(PlugInCanonical, CanonicalValuesAndTheDiagnosis) {
 }
 
 TEST(PlugInComputed, PropertiesReadThePlugInDictionary) {
-    struct Case {
-        Value top;
-        bool data, dedicated, hybrid;
-        Value sdk, embeddedProtocol;
-    };
-    const Case cases[] = {
+    // {top dictionary, data, dedicated, hybrid, SDK, embedded protocol}
+    const std::tuple<Value, bool, bool, bool, Value, Value> cases[] = {
         {dict({{"VTExtensionProtocol", "#Data"}, {"VTExtensionPointIdentifier", "ovaro.sdk"}, {"Dedicated", true}}),
          true, true, false, Value("ovaro.sdk"), Value("#Data")},  // the embedded protocol falls back to the protocol
         {dict({{"VTExtensionProtocol", "P"}, {"EmbeddedProtocol", "E"}}), false, false, false, Value(), Value("E")},
         {dict({{"Dedicated", false}, {"EmbeddedCode", false}}), false, false, true, Value(), Value()},  // any value counts
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.top.description());
-        auto plugIn = setUp(newStyleInfo(c.top));
+    for (const auto& [top, data, dedicated, hybrid, sdk, embeddedProtocol] : cases) {
+        SCOPED_TRACE(top.description());
+        auto plugIn = setUp(newStyleInfo(top));
         ASSERT_TRUE(plugIn);
-        EXPECT_EQ(plugIn->isData(), c.data);
-        EXPECT_EQ(plugIn->isDedicated(), c.dedicated);
-        EXPECT_EQ(plugIn->isHybrid(), c.hybrid);
-        EXPECT_EQ(plugIn->sdkSpec(), c.sdk);
-        EXPECT_EQ(plugIn->embeddedProtocolSpec(), c.embeddedProtocol);
+        EXPECT_EQ(plugIn->isData(), data);
+        EXPECT_EQ(plugIn->isDedicated(), dedicated);
+        EXPECT_EQ(plugIn->isHybrid(), hybrid);
+        EXPECT_EQ(plugIn->sdkSpec(), sdk);
+        EXPECT_EQ(plugIn->embeddedProtocolSpec(), embeddedProtocol);
         EXPECT_FALSE(plugIn->isAppExtension());
         EXPECT_EQ(plugIn->embeddedCodePath(), std::nullopt);
         plugIn->setLastModified(-86400);

@@ -6,6 +6,7 @@
 
 #include <cstdint>
 #include <limits>
+#include <tuple>
 
 #include "support/TempDir.h"
 
@@ -21,13 +22,8 @@ TEST(ActivationRule, MatchesWhenEveryOfferedTypeFitsSomeKey) {
     const std::uint64_t huge = std::numeric_limits<std::uint64_t>::max();
     const Value bitmaps(Dictionary{{"image/x-bitmap", Value(2)}});
 
-    struct Case {
-        const char* name;
-        Value rule;
-        Value offer;
-        bool matches;
-    };
-    const Case cases[] = {
+    // {what, rule, offer, matches}
+    const std::tuple<const char*, Value, Value, bool> cases[] = {
         {"parent key", bitmaps, Dictionary{{"image/png", Value(1)}}, true},
         {"count at the maximum", bitmaps, Dictionary{{"image/png", Value(2)}}, true},
         {"count over the maximum", bitmaps, Dictionary{{"image/png", Value(3)}}, false},
@@ -56,8 +52,8 @@ TEST(ActivationRule, MatchesWhenEveryOfferedTypeFitsSomeKey) {
          false},
         {"offer not a dictionary", bitmaps, Value("image/png"), false},
     };
-    for (const auto& c : cases) {
-        EXPECT_EQ(qm::activationRuleMatches(c.rule, c.offer, types), c.matches) << c.name;
+    for (const auto& [what, rule, offer, matches] : cases) {
+        EXPECT_EQ(qm::activationRuleMatches(rule, offer, types), matches) << what;
     }
 }
 

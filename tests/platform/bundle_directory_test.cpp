@@ -7,7 +7,6 @@
 #include <thread>
 #include <vector>
 
-#include "platform/plist/PropertyList.h"
 #include "support/LogCapture.h"
 #include "support/TempDir.h"
 
@@ -15,17 +14,15 @@ namespace {
 
 using qm::BundleDirectory;
 
-void writeInfo(const std::string& path, const qm::Dictionary& info) {
-    qmtest::writeFile(path, "");
-    ASSERT_FALSE(qm::plist::writeFileAtomically(path, qm::Value(info), qm::plist::Format::xml));
-}
+using qmtest::writePlist;
 
 // Foo.app/Info.plist beside Foo.app/Foo, or Foo.app/Contents/Info.plist and
 // Foo.app/Contents/Exec/Foo.
 std::string makeBundle(const qmtest::TempDir& dir, bool desktop = false) {
     std::string bundle = dir.file("Foo.app");
     std::string infoFolder = desktop ? bundle + "/Contents" : bundle;
-    writeInfo(infoFolder + "/Info.plist", {{"MRBundleExecutable", "Foo"}, {"MRBundleIdentifier", "com.example.foo"}});
+    writePlist(infoFolder + "/Info.plist",
+               qm::Dictionary{{"MRBundleExecutable", "Foo"}, {"MRBundleIdentifier", "com.example.foo"}});
     qmtest::writeFile(infoFolder + (desktop ? "/Exec/Foo" : "/Foo"), "#!/bin/sh\n");
     return bundle;
 }
@@ -82,7 +79,8 @@ TEST(BundleDirectory, ExecutableNamesThatAreNotPlainFileNamesAreIgnored) {
     const qm::Value names[] = {"../../etc/passwd", "a/b", "..", "", 3, qm::Value()};
     for (std::size_t i = 0; i < std::size(names); ++i) {
         std::string bundle = dir.file("B" + std::to_string(i) + ".app");
-        writeInfo(bundle + "/Info.plist", names[i].isNull() ? qm::Dictionary{} : qm::Dictionary{{"MRBundleExecutable", names[i]}});
+        writePlist(bundle + "/Info.plist",
+                   names[i].isNull() ? qm::Dictionary{} : qm::Dictionary{{"MRBundleExecutable", names[i]}});
         auto directory = BundleDirectory::atPath(bundle);
         ASSERT_TRUE(directory);
         EXPECT_FALSE(directory->executablePath()) << names[i].description();
@@ -114,18 +112,17 @@ TEST(BundleDirectory, TheInfoDictionaryIsReadOnceAndSharedByCopiesAndThreads) {
     ASSERT_TRUE(bundle);
     BundleDirectory copy = *bundle;
     std::vector<std::optional<qm::Value>> seen(8);
-    std::vector<std::thread> threads;
-    for (std::size_t i = 0; i < seen.size(); ++i) {
-        threads.emplace_back([&, i] { seen[i] = (i % 2 ? copy : *bundle).infoDictionary(); });
-    }
-    for (auto& thread : threads) {
-        thread.join();
+    {
+        std::vector<std::jthread> threads;
+        for (std::size_t i = 0; i < seen.size(); ++i) {
+            threads.emplace_back([&, i] { seen[i] = (i % 2 ? copy : *bundle).infoDictionary(); });
+        }
     }
     for (const auto& info : seen) {
         ASSERT_TRUE(info);
         EXPECT_TRUE(info->isSameObject(*seen[0]));
     }
-    writeInfo(path + "/Info.plist", {{"MRBundleIdentifier", "changed"}});
+    writePlist(path + "/Info.plist", qm::Dictionary{{"MRBundleIdentifier", "changed"}});
     EXPECT_EQ(*copy.infoDictionary()->get("MRBundleIdentifier"), qm::Value("com.example.foo"));
     EXPECT_EQ(*BundleDirectory::atPath(path)->infoDictionary()->get("MRBundleIdentifier"), qm::Value("changed"))
         << "a new handle reads the file again";

@@ -6,8 +6,8 @@
 
 #include <functional>
 #include <string>
+#include <tuple>
 
-#include "platform/plist/PropertyList.h"
 #include "support/LogCapture.h"
 #include "support/TempDir.h"
 
@@ -26,14 +26,12 @@ struct Bundle {
         path = dir.file(desktopStyle ? "Desk.app" : "Flat.app");
         infoFolder = desktopStyle ? path + "/Contents" : path;
         entitlements = infoFolder + "/Entitlements.plist";
-        qmtest::writeFile(infoFolder + "/Info.plist", "");
-        EXPECT_FALSE(qm::plist::writeFileAtomically(infoFolder + "/Info.plist", qm::Value(qm::Dictionary{{"MRBundleIdentifier", "x"}}),
-                                                    qm::plist::Format::xml));
+        qmtest::writePlist(infoFolder + "/Info.plist", qm::Dictionary{{"MRBundleIdentifier", "x"}});
         write(kGranted);
         EXPECT_EQ(::chmod(infoFolder.c_str(), 0755), 0);
     }
     void write(const qm::Value& value) {
-        EXPECT_FALSE(qm::plist::writeFileAtomically(entitlements, value, qm::plist::Format::xml));
+        qmtest::writePlist(entitlements, value);
         EXPECT_EQ(::chmod(entitlements.c_str(), 0644), 0);
     }
     std::optional<qm::Value> read() const { return qm::readEntitlements(*qm::BundleDirectory::atPath(path)); }
@@ -56,13 +54,8 @@ TEST(Entitlements, ATrustedFileBesideEitherLayoutsInfoIsHonouredSilently) {
 
 // An untrusted or unreadable file gives no entitlements and exactly one line.
 TEST(Entitlements, AFileThatCannotBeTrustedIsRefusedWithOneLine) {
-    struct Case {
-        const char* what;
-        std::function<void(Bundle&)> spoil;
-        const char* logged;
-        bool needsRoot = false;
-    };
-    const Case cases[] = {
+    // {what, how the bundle is spoilt, what its one line says}
+    const std::tuple<const char*, std::function<void(Bundle&)>, std::string> cases[] = {
         {"group-writable folder", [](Bundle& b) { ::chmod(b.infoFolder.c_str(), 0775); }, "writable by group or others"},
         {"world-writable folder", [](Bundle& b) { ::chmod(b.infoFolder.c_str(), 0757); }, "writable by group or others"},
         {"group-writable file", [](Bundle& b) { ::chmod(b.entitlements.c_str(), 0664); }, "writable by group or others"},
@@ -88,21 +81,21 @@ TEST(Entitlements, AFileThatCannotBeTrustedIsRefusedWithOneLine) {
          },
          "entitlements unreadable"},
         {"file of another user", [](Bundle& b) { EXPECT_EQ(::chown(b.entitlements.c_str(), kNobody, kNobody), 0); },
-         "owned by uid 65534", true},
+         "owned by uid 65534"},
         {"folder of another user", [](Bundle& b) { EXPECT_EQ(::chown(b.infoFolder.c_str(), kNobody, kNobody), 0); },
-         "owned by uid 65534", true},
+         "owned by uid 65534"},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.what);
-        if (c.needsRoot && ::geteuid() != 0) {
+    for (const auto& [what, spoil, logged] : cases) {
+        SCOPED_TRACE(what);
+        if (logged.starts_with("owned by") && ::geteuid() != 0) {
             continue;  // changing an owner needs root
         }
         Bundle bundle(false);
-        c.spoil(bundle);
+        spoil(bundle);
         LogCapture log;
         EXPECT_EQ(bundle.read(), std::nullopt);
         ASSERT_EQ(log.lines().size(), 1u) << log.text();
-        EXPECT_NE(log.lines()[0].find(c.logged), std::string::npos) << log.lines()[0];
+        EXPECT_NE(log.lines()[0].find(logged), std::string::npos) << log.lines()[0];
     }
 }
 

@@ -7,6 +7,8 @@
 #include <cmath>
 #include <limits>
 #include <string>
+#include <tuple>
+#include <vector>
 
 #include "platform/value/Json.h"
 
@@ -18,38 +20,23 @@ constexpr auto kU64Max = std::numeric_limits<std::uint64_t>::max();
 constexpr auto kI64Min = std::numeric_limits<std::int64_t>::min();
 
 TEST(Json, WritesEachTypeInItsSpelling) {
-    struct Case {
-        Value value;
-        std::string compact;
+    // A whole double stays a double when read back; a date without a
+    // calendar spelling is the seconds themselves; bytes that are not UTF-8
+    // cannot be written as they are.
+    const std::pair<Value, std::string> cases[] = {
+        {Value(), "null"}, {false, "false"}, {kU64Max, "18446744073709551615"}, {kI64Min, "-9223372036854775808"},
+        {0.1, "0.1"}, {5.0, "5.0"}, {1e300, "1e+300"},
+        {std::nan(""), "null"}, {-std::numeric_limits<double>::infinity(), "null"},
+        {kUuid, R"("00112233-4455-6677-8899-aabbccddeeff")"},
+        {Bytes{0, 1, 2, 3}, R"("AAECAw==")"}, {Bytes{0xFF, 0xEE}, R"("/+4=")"}, {Bytes{1, 2, 3}, R"("AQID")"}, {Bytes{}, R"("")"},
+        {Date{978307200.25}, R"("2001-01-01T00:00:00.25Z")"}, {Date{-0.5}, R"("1969-12-31T23:59:59.5Z")"},
+        {Date{951782400}, R"("2000-02-29T00:00:00Z")"}, {Date{253402300799}, R"("9999-12-31T23:59:59Z")"},
+        {Date{-62167219200}, R"("0000-01-01T00:00:00Z")"}, {Date{1e15}, "1e+15"},
+        {std::string("q\"\n\x01\0", 5), R"("q\"\n\u0001\u0000")"}, {"h\xC3\xA9", "\"h\xC3\xA9\""},
+        {"a\xFF" "b\xED\xA0\x80", "\"a\xEF\xBF\xBD" "b\xEF\xBF\xBD\xEF\xBF\xBD\xEF\xBF\xBD\""},
     };
-    const Case cases[] = {
-        {Value(), "null"},
-        {Value(false), "false"},
-        {Value(kU64Max), "18446744073709551615"},
-        {Value(kI64Min), "-9223372036854775808"},
-        {Value(0.1), "0.1"},
-        {Value(5.0), "5.0"},  // a whole double stays a double when read back
-        {Value(1e300), "1e+300"},
-        {Value(std::nan("")), "null"},
-        {Value(-std::numeric_limits<double>::infinity()), "null"},
-        {Value(kUuid), R"("00112233-4455-6677-8899-aabbccddeeff")"},
-        {Value(Bytes{0, 1, 2, 3}), R"("AAECAw==")"},
-        {Value(Bytes{0xFF, 0xEE}), R"("/+4=")"},
-        {Value(Bytes{1, 2, 3}), R"("AQID")"},
-        {Value(Bytes{}), R"("")"},
-        {Value(Date{978307200.25}), R"("2001-01-01T00:00:00.25Z")"},
-        {Value(Date{-0.5}), R"("1969-12-31T23:59:59.5Z")"},
-        {Value(Date{951782400}), R"("2000-02-29T00:00:00Z")"},
-        {Value(Date{253402300799}), R"("9999-12-31T23:59:59Z")"},
-        {Value(Date{-62167219200}), R"("0000-01-01T00:00:00Z")"},
-        {Value(Date{1e15}), "1e+15"},  // no calendar spelling: the seconds themselves
-        {Value(std::string("q\"\n\x01\0", 5)), R"("q\"\n\u0001\u0000")"},
-        {Value("h\xC3\xA9"), "\"h\xC3\xA9\""},
-        // Bytes that are not UTF-8 cannot be written as they are.
-        {Value("a\xFF" "b\xED\xA0\x80"), "\"a\xEF\xBF\xBD" "b\xEF\xBF\xBD\xEF\xBF\xBD\xEF\xBF\xBD\""},
-    };
-    for (const Case& c : cases) {
-        EXPECT_EQ(json::write(c.value, false), c.compact) << c.value.description();
+    for (const auto& [value, compact] : cases) {
+        EXPECT_EQ(json::write(value, false), compact) << value.description();
     }
 }
 
@@ -73,54 +60,32 @@ TEST(Json, WritesContainersCompactAndPretty) {
 }
 
 TEST(Json, ParsesValuesWithTheirTypes) {
-    struct Case {
-        std::string text;
-        Value expected;
-        ValueType type;
-    };
-    const Case cases[] = {
-        {" null ", Value(), ValueType::null},
-        {"true", Value(true), ValueType::boolean},
-        {"0", Value(0u), ValueType::unsignedInteger},
-        {"18446744073709551615", Value(kU64Max), ValueType::unsignedInteger},
-        {"-42", Value(-42), ValueType::signedInteger},
-        {"-9223372036854775808", Value(kI64Min), ValueType::signedInteger},
-        {"-0", Value(0), ValueType::signedInteger},
-        {"1.0", Value(1.0), ValueType::real},
-        {"2.5E-3", Value(0.0025), ValueType::real},
-        {"1e2", Value(100.0), ValueType::real},
-        {"\xEF\xBB\xBF" "7", Value(7u), ValueType::unsignedInteger},  // byte-order mark
-        {R"("a\"\/\t\u00e9\u0000\ud83d\ude00")", Value(std::string("a\"/\t\xC3\xA9\0\xF0\x9F\x98\x80", 11)),
-         ValueType::string},
+    // Each reads as a value of the expected one's very type. A byte-order
+    // mark is skipped; a leap second is the next second; any other object is
+    // a dictionary, even with such a key among others.
+    const std::pair<std::string, Value> cases[] = {
+        {" null ", Value()}, {"true", true}, {"0", 0u}, {"18446744073709551615", kU64Max}, {"-42", -42},
+        {"-9223372036854775808", kI64Min}, {"-0", 0}, {"1.0", 1.0}, {"2.5E-3", 0.0025}, {"1e2", 100.0},
+        {"\xEF\xBB\xBF" "7", 7u},
+        {R"("a\"\/\t\u00e9\u0000\ud83d\ude00")", std::string("a\"/\t\xC3\xA9\0\xF0\x9F\x98\x80", 11)},
         {R"( { "b" : [1, -1, 1.5, "s", null], "a": {} } )",
-         Value(Dictionary{{"a", Value(Dictionary{})},
-                          {"b", Value(Array{Value(1u), Value(-1), Value(1.5), Value("s"), Value()})}}),
-         ValueType::dictionary},
-        {R"({"$uuid": "00112233-4455-6677-8899-AABBCCDDEEFF"})", Value(kUuid), ValueType::uuid},
-        {R"({"$data": "AAECAw=="})", Value(Bytes{0, 1, 2, 3}), ValueType::data},
-        {R"({"$data": "AQID"})", Value(Bytes{1, 2, 3}), ValueType::data},
-        {R"({"$data": ""})", Value(Bytes{}), ValueType::data},
-        {R"({"$date": "2001-01-01t01:30:00.25+01:30"})", Value(Date{978307200.25}), ValueType::date},
-        {R"({"$date": "1969-12-31T23:59:59-00:00"})", Value(Date{-1}), ValueType::date},
-        {R"({"$date": "2000-02-29T23:59:60Z"})", Value(Date{951868800}), ValueType::date},  // leap second
-        // Any other object is a dictionary, even with such a key among others.
-        {R"({"$uuid": "x", "y": 1})", Value(Dictionary{{"$uuid", Value("x")}, {"y", Value(1u)}}), ValueType::dictionary},
-        {R"({"$other": 1})", Value(Dictionary{{"$other", Value(1u)}}), ValueType::dictionary},
+         Dictionary{{"a", Value(Dictionary{})}, {"b", Value(Array{Value(1u), Value(-1), Value(1.5), Value("s"), Value()})}}},
+        {R"({"$uuid": "00112233-4455-6677-8899-AABBCCDDEEFF"})", kUuid},
+        {R"({"$data": "AAECAw=="})", Bytes{0, 1, 2, 3}}, {R"({"$data": "AQID"})", Bytes{1, 2, 3}}, {R"({"$data": ""})", Bytes{}},
+        {R"({"$date": "2001-01-01t01:30:00.25+01:30"})", Date{978307200.25}},
+        {R"({"$date": "1969-12-31T23:59:59-00:00"})", Date{-1}}, {R"({"$date": "2000-02-29T23:59:60Z"})", Date{951868800}},
+        {R"({"$uuid": "x", "y": 1})", Dictionary{{"$uuid", Value("x")}, {"y", Value(1u)}}},
+        {R"({"$other": 1})", Dictionary{{"$other", Value(1u)}}},
     };
-    for (const Case& c : cases) {
-        auto parsed = json::parse(c.text);
-        ASSERT_TRUE(parsed.ok()) << c.text << ": " << parsed.error().text();
-        EXPECT_EQ(*parsed, c.expected) << c.text;
-        EXPECT_EQ(parsed->type(), c.type) << c.text;
+    for (const auto& [text, expected] : cases) {
+        auto parsed = json::parse(text);
+        ASSERT_TRUE(parsed.ok()) << text << ": " << parsed.error().text();
+        EXPECT_EQ(*parsed, expected) << text;
+        EXPECT_EQ(parsed->type(), expected.type()) << text;
     }
 }
 
 TEST(Json, RefusalsSayWhatAndWhere) {
-    struct Case {
-        std::string text;
-        std::string reason;  // a part of the message
-        std::string where;   // how the message ends
-    };
     const std::string deepObjects = [] {
         std::string text;
         for (int i = 0; i < 513; ++i) {
@@ -128,7 +93,8 @@ TEST(Json, RefusalsSayWhatAndWhere) {
         }
         return text + "1" + std::string(513, '}');
     }();
-    const Case cases[] = {
+    // {text, a part of the message, how the message ends}
+    std::vector<std::tuple<std::string, std::string, std::string>> cases = {
         {"", "unexpected end of input", "line 1, column 1"},
         {"[1,\n 2]\n x", "invalid literal; expected end of input", "line 3, column 2"},
         {"{a:1}", "object key - invalid literal; expected string literal", "line 1, column 2"},
@@ -151,43 +117,33 @@ TEST(Json, RefusalsSayWhatAndWhere) {
         {R"({"$uuid": 5})", "\"$uuid\" needs a UUID", "line 1, column 1"},
         {R"({"$date": "2001-02-29T00:00:00Z"})", "\"$date\" needs an RFC 3339 date-time", "line 1, column 1"},
     };
-    for (const Case& c : cases) {
-        auto result = json::parse(c.text);
-        ASSERT_FALSE(result.ok()) << c.text << " gave " << result.value().description();
+    // Data and dates take only their canonical spelling.
+    for (const char* bad :
+         {"AAECAw", "AAECAw=", "AA=CAw==", "AAECA*==", "AB==", "AAB=", "A===", "====", " AAA", "AAA=\\n", "AAECAw==="}) {
+        cases.emplace_back(std::string(R"([{"$data": ")") + bad + "\"}]", "\"$data\" needs base64 text", "line 1, column 2");
+    }
+    for (const char* bad : {"2001-01-01", "2001-01-01T00:00:00", "2001-13-01T00:00:00Z", "2001-01-01T24:00:00Z",
+                            "2001-01-01T00:60:00Z", "2001-01-01T00:00:00.Z", "2001-01-01T00:00:00+1:00",
+                            "2001-01-01 00:00:00Z", "2001-01-01T00:00:00Zjunk"}) {
+        cases.emplace_back(std::string(R"({"$date": ")") + bad + "\"}", "\"$date\" needs an RFC 3339 date-time",
+                           "line 1, column 1");
+    }
+    for (const auto& [text, reason, where] : cases) {
+        auto result = json::parse(text);
+        ASSERT_FALSE(result.ok()) << text << " gave " << result.value().description();
         EXPECT_EQ(result.error().domain, "json");
         const std::string& message = result.error().text();
-        EXPECT_NE(message.find(c.reason), std::string::npos) << message;
-        EXPECT_TRUE(message.ends_with(" at " + c.where)) << message;
+        EXPECT_NE(message.find(reason), std::string::npos) << message;
+        EXPECT_TRUE(message.ends_with(" at " + where)) << message;
         EXPECT_EQ(message.find("last read"), std::string::npos) << message;
     }
     EXPECT_TRUE(json::parse(std::string(512, '[') + std::string(512, ']')).ok());
 }
 
-TEST(Json, DataAndDatesTakeOnlyTheirCanonicalSpelling) {
-    for (const char* bad : {"AAECAw", "AAECAw=", "AA=CAw==", "AAECA*==", "AB==", "AAB=", "A===", "====", " AAA",
-                            "AAA=\\n", "AAECAw==="}) {
-        auto result = json::parse(std::string(R"([{"$data": ")") + bad + "\"}]");
-        EXPECT_EQ(result.ok() ? "accepted" : result.error().text(), "\"$data\" needs base64 text at line 1, column 2")
-            << bad;
-    }
-    for (const char* bad : {"2001-01-01", "2001-01-01T00:00:00", "2001-13-01T00:00:00Z", "2001-01-01T24:00:00Z",
-                            "2001-01-01T00:60:00Z", "2001-01-01T00:00:00.Z", "2001-01-01T00:00:00+1:00",
-                            "2001-01-01 00:00:00Z", "2001-01-01T00:00:00Zjunk"}) {
-        auto result = json::parse(std::string(R"({"$date": ")") + bad + "\"}");
-        EXPECT_FALSE(result.ok()) << bad;
-    }
-}
-
 TEST(Json, WrittenTextParsesBackToTheSameValue) {
-    Value value(Dictionary{
-        {"n", Value(std::int64_t{-7})},
-        {"u", Value(kU64Max)},
-        {"d", Value(0.30000000000000004)},
-        {"whole", Value(3.0)},
-        {"big", Value(1e14)},
-        {"s", Value("line\nbreak \"quoted\" \xE2\x82\xAC \x01")},
-        {"list", Value(Array{Value(), Value(true), Value(Array{Value(Dictionary{})})})},
-    });
+    Value value(Dictionary{{"n", std::int64_t{-7}}, {"u", kU64Max}, {"d", 0.30000000000000004}, {"whole", 3.0}, {"big", 1e14},
+                           {"s", "line\nbreak \"quoted\" \xE2\x82\xAC \x01"},
+                           {"list", Value(Array{Value(), Value(true), Value(Array{Value(Dictionary{})})})}});
     for (bool pretty : {false, true}) {
         auto back = json::parse(json::write(value, pretty));
         ASSERT_TRUE(back.ok()) << back.error().text();

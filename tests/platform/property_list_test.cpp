@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <limits>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "support/TempDir.h"
@@ -25,10 +26,6 @@ constexpr std::int64_t kInt64Max = std::numeric_limits<std::int64_t>::max();
 
 qm::Bytes bytesOf(std::string_view text) {
     return qm::Bytes(text.begin(), text.end());
-}
-
-std::string textOf(const qm::Bytes& bytes) {
-    return std::string(bytes.begin(), bytes.end());
 }
 
 std::string xmlDocument(std::string_view body) {
@@ -64,6 +61,13 @@ void expectRefused(const qm::Result<Value>& result, int code) {
     EXPECT_EQ(result.error().code, code) << result.error().text();
 }
 
+// Appends the value big-endian in `size` bytes.
+void append(qm::Bytes& out, std::uint64_t value, unsigned size) {
+    for (unsigned i = size; i > 0; --i) {
+        out.push_back(static_cast<std::uint8_t>(value >> (8 * (i - 1))));
+    }
+}
+
 // A binary property list from encoded objects: 8-byte offsets, refSize-byte references.
 qm::Bytes binaryList(const std::vector<qm::Bytes>& objects, unsigned refSize, std::uint64_t top = 0) {
     qm::Bytes out = bytesOf("bplist00");
@@ -72,60 +76,41 @@ qm::Bytes binaryList(const std::vector<qm::Bytes>& objects, unsigned refSize, st
         offsets.push_back(out.size());
         out.insert(out.end(), object.begin(), object.end());
     }
-    auto appendNumber = [&out](std::uint64_t value, unsigned size) {
-        for (unsigned i = size; i > 0; --i) {
-            out.push_back(static_cast<std::uint8_t>(value >> (8 * (i - 1))));
-        }
-    };
     std::uint64_t table = out.size();
     for (auto offset : offsets) {
-        appendNumber(offset, 8);
+        append(out, offset, 8);
     }
-    out.insert(out.end(), 6, 0);
-    out.push_back(8);
-    out.push_back(static_cast<std::uint8_t>(refSize));
-    appendNumber(objects.size(), 8);
-    appendNumber(top, 8);
-    appendNumber(table, 8);
+    out.insert(out.end(), {0, 0, 0, 0, 0, 0, 8, static_cast<std::uint8_t>(refSize)});
+    append(out, objects.size(), 8);
+    append(out, top, 8);
+    append(out, table, 8);
     return out;
 }
 
+// An array of fewer than 15 references.
 qm::Bytes arrayObject(const std::vector<std::uint64_t>& refs, unsigned refSize) {
-    qm::Bytes object;
-    if (refs.size() < 15) {
-        object.push_back(static_cast<std::uint8_t>(0xA0 | refs.size()));
-    } else {
-        object.push_back(0xAF);
-        object.push_back(0x12);
-        for (int shift = 24; shift >= 0; shift -= 8) {
-            object.push_back(static_cast<std::uint8_t>(refs.size() >> shift));
-        }
-    }
+    qm::Bytes object{static_cast<std::uint8_t>(0xA0 | refs.size())};
     for (auto ref : refs) {
-        for (unsigned i = refSize; i > 0; --i) {
-            object.push_back(static_cast<std::uint8_t>(ref >> (8 * (i - 1))));
-        }
+        append(object, ref, refSize);
     }
     return object;
 }
 
 const qm::Bytes kTrueObject{0x09};
 
+// The dates a property list can hold: a signed 32-bit count of seconds from 2001.
+const double kEarliest = qm::plist::kSecondsFrom1970To2001 + std::numeric_limits<std::int32_t>::min();
+const double kLatest = qm::plist::kSecondsFrom1970To2001 + std::numeric_limits<std::int32_t>::max();
+
 class PropertyListFormats : public ::testing::TestWithParam<Format> {};
 
 TEST_P(PropertyListFormats, ScalarsAndContainersRoundTripWithTheirTypes) {
     Value value(Dictionary{
-        {"yes", true},
-        {"no", false},
-        {"real", 2.5},
-        {"tiny", 1e-300},
-        {"text", "caf\xc3\xa9 <&> \"quoted\" \xf0\x9f\x98\x80"},
-        {"empty text", ""},
-        {"data", Value(qm::Bytes{0, 1, 2, 0xff})},
-        {"empty data", Value(qm::Bytes{})},
+        {"yes", true}, {"no", false}, {"real", 2.5}, {"tiny", 1e-300}, {"key with spaces & marks", true},
+        {"text", "caf\xc3\xa9 <&> \"quoted\" \xf0\x9f\x98\x80"}, {"empty text", ""},
+        {"data", Value(qm::Bytes{0, 1, 2, 0xff})}, {"empty data", Value(qm::Bytes{})},
         {"list", Value(Array{Value(1), Value("two"), Value(Array{Value(3.0)})})},
         {"inner", Value(Dictionary{{"empty array", Value(Array{})}, {"empty dict", Value(Dictionary{})}})},
-        {"key with spaces & marks", true},
         {"integers", Value(Array{std::int64_t{-1}, std::int64_t{-5}, kInt64Min, kInt64Max, std::int64_t{0}})},
         {"unsigned", Value(static_cast<std::uint64_t>(kInt64Max))},
     });
@@ -140,9 +125,7 @@ TEST_P(PropertyListFormats, ScalarsAndContainersRoundTripWithTheirTypes) {
 }
 
 TEST_P(PropertyListFormats, WholeSecondDatesRoundTripUpToTheEdgesOfTheWritableRange) {
-    const double earliest = qm::plist::kSecondsFrom1970To2001 + std::numeric_limits<std::int32_t>::min();
-    const double latest = qm::plist::kSecondsFrom1970To2001 + std::numeric_limits<std::int32_t>::max();
-    for (double seconds : {0.0, 978307200.0, 978307199.0, 1700000000.0, -1000000.0, earliest, latest}) {
+    for (double seconds : {0.0, 978307200.0, 978307199.0, 1700000000.0, -1000000.0, kEarliest, kLatest}) {
         Value back = roundTrip(Value(qm::Date{seconds}), GetParam());
         ASSERT_EQ(back.type(), qm::ValueType::date) << seconds;
         EXPECT_EQ(back.asDate()->secondsSince1970, seconds);
@@ -151,22 +134,16 @@ TEST_P(PropertyListFormats, WholeSecondDatesRoundTripUpToTheEdgesOfTheWritableRa
 
 // What a property list cannot hold is an error naming where, never a silent change.
 TEST_P(PropertyListFormats, ValuesWithoutAPropertyListFormAreRefused) {
-    const double earliest = qm::plist::kSecondsFrom1970To2001 + std::numeric_limits<std::int32_t>::min();
-    const double latest = qm::plist::kSecondsFrom1970To2001 + std::numeric_limits<std::int32_t>::max();
     Value deep(Array{});
     for (unsigned i = 1; i < qm::plist::kMaxNesting; ++i) {
         deep = Value(Array{deep});
     }
     EXPECT_TRUE(qm::plist::serialize(deep, GetParam()).ok());
-    struct Case {
-        Value value;
-        int code;
-        const char* where;
-    };
-    const Case cases[] = {
+    // {value, error code, where the message says it is}
+    const std::tuple<Value, int, const char*> cases[] = {
         {Value(std::uint64_t{1} << 63), qm::plist::kErrorUnsupported, ""},
-        {Value(qm::Date{earliest - 1}), qm::plist::kErrorUnsupported, "date"},
-        {Value(qm::Date{latest + 1}), qm::plist::kErrorUnsupported, "date"},
+        {Value(qm::Date{kEarliest - 1}), qm::plist::kErrorUnsupported, "date"},
+        {Value(qm::Date{kLatest + 1}), qm::plist::kErrorUnsupported, "date"},
         {Value(qm::Date{4102444800.0}), qm::plist::kErrorUnsupported, "date"},   // 2100
         {Value(qm::Date{-2208988800.0}), qm::plist::kErrorUnsupported, "date"},  // 1900
         {Value(Dictionary{{"a", Value(Array{Value(1), Value()})}}), qm::plist::kErrorUnsupported, "/a/1"},
@@ -178,12 +155,12 @@ TEST_P(PropertyListFormats, ValuesWithoutAPropertyListFormAreRefused) {
         {Value(Dictionary{{"\xc3", Value(1)}}), qm::plist::kErrorUnsupported, ""},
         {Value(Array{deep}), qm::plist::kErrorTooComplex, ""},
     };
-    for (const Case& c : cases) {
-        auto bytes = qm::plist::serialize(c.value, GetParam());
-        ASSERT_FALSE(bytes.ok()) << c.value.description();
+    for (const auto& [value, code, where] : cases) {
+        auto bytes = qm::plist::serialize(value, GetParam());
+        ASSERT_FALSE(bytes.ok()) << value.description();
         EXPECT_EQ(bytes.error().domain, qm::plist::kErrorDomain);
-        EXPECT_EQ(bytes.error().code, c.code) << c.value.description();
-        EXPECT_NE(bytes.error().text().find(c.where), std::string::npos) << bytes.error().text();
+        EXPECT_EQ(bytes.error().code, code) << value.description();
+        EXPECT_NE(bytes.error().text().find(where), std::string::npos) << bytes.error().text();
     }
 }
 
@@ -199,17 +176,13 @@ TEST(PropertyList, BinaryKeepsFractionsOfSecondsXmlWritesWholeOnes) {
                                       std::pair{Value(Array{std::int64_t{-5}}), "<integer>-5</integer>"}}) {
         auto bytes = qm::plist::serialize(value, Format::xml);
         ASSERT_TRUE(bytes.ok());
-        EXPECT_NE(textOf(*bytes).find(text), std::string::npos) << textOf(*bytes);
+        std::string xml(bytes->begin(), bytes->end());
+        EXPECT_NE(xml.find(text), std::string::npos) << xml;
     }
 }
 
 TEST(PropertyList, XmlDocumentsReadAsTheirValues) {
-    struct Case {
-        const char* what;
-        std::string body;
-        Value expected;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, std::string, Value> cases[] = {
         {"a typical Info file", R"(<!-- a comment -->
 <dict>
 	<key>MRBundleIdentifier</key>
@@ -234,11 +207,11 @@ TEST(PropertyList, XmlDocumentsReadAsTheirValues) {
         {"dates outside the writable range", "<array><date>9999-01-01T00:00:00Z</date><date>1900-01-01T00:00:00Z</date></array>",
          Value(Array{qm::Date{253370764800.0}, qm::Date{-2208988800.0}})},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.what);
-        auto value = qm::plist::parse(bytesOf(xmlDocument(c.body)));
+    for (const auto& [what, body, expected] : cases) {
+        SCOPED_TRACE(what);
+        auto value = qm::plist::parse(bytesOf(xmlDocument(body)));
         ASSERT_TRUE(value.ok()) << value.error().text();
-        EXPECT_EQ(*value, c.expected);
+        EXPECT_EQ(*value, expected);
     }
     EXPECT_TRUE(qm::plist::parse(bytesOf(nestedXml(qm::plist::kMaxNesting))).ok());
 }
@@ -248,34 +221,26 @@ TEST(PropertyList, BrokenOrHostileXmlIsRefusedWithoutCrashing) {
     for (int i = 0; i < 200000; ++i) {
         unfinished += "<array>";
     }
-    struct Case {
-        std::string document;
-        int code;
-    };
-    const Case cases[] = {
-        {"", qm::plist::kErrorMalformed},
-        {"garbage", qm::plist::kErrorMalformed},
+    const std::pair<std::string, int> cases[] = {
+        {"", qm::plist::kErrorMalformed}, {"garbage", qm::plist::kErrorMalformed}, {"bplist00", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><dict><key>a</key>", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><array><string>x</array></plist>", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><dict><integer>1</integer></dict></plist>", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><array><bogus/></array></plist>", qm::plist::kErrorMalformed},
         {"<plist version=\"1.0\"><array></dict></plist>", qm::plist::kErrorMalformed},
-        {"bplist00", qm::plist::kErrorMalformed},
         {xmlDocument("<array><string>ok</string><string>\xff\xfe</string></array>"), qm::plist::kErrorMalformed},
         {"<!DOCTYPE plist [ <!ENTITY x \"y\"> ]><plist version=\"1.0\"><array/></plist>", qm::plist::kErrorMalformed},
         {"<plist version=\"1>\"><array/></plist>", qm::plist::kErrorMalformed},
-        {nestedXml(qm::plist::kMaxNesting + 1), qm::plist::kErrorTooComplex},
-        {nestedXml(200000), qm::plist::kErrorTooComplex},
+        {nestedXml(qm::plist::kMaxNesting + 1), qm::plist::kErrorTooComplex}, {nestedXml(200000), qm::plist::kErrorTooComplex},
         // Closing tags hidden in comments do not make the nesting look shallower.
         {nestedXml(2000, "<!-- </array></array> -->"), qm::plist::kErrorTooComplex},
-        {unfinished, qm::plist::kErrorTooComplex},
-        {std::string(qm::plist::kMaxBytes + 1, ' '), qm::plist::kErrorTooComplex},
+        {unfinished, qm::plist::kErrorTooComplex}, {std::string(qm::plist::kMaxBytes + 1, ' '), qm::plist::kErrorTooComplex},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.document.substr(0, 80));
-        expectRefused(qm::plist::parse(bytesOf(c.document)), c.code);
+    for (const auto& [document, code] : cases) {
+        SCOPED_TRACE(document.substr(0, 80));
+        expectRefused(qm::plist::parse(bytesOf(document)), code);
     }
-    auto notUtf8 = qm::plist::parse(bytesOf(cases[8].document));
+    auto notUtf8 = qm::plist::parse(bytesOf(cases[8].first));
     EXPECT_NE(notUtf8.error().text().find("/1"), std::string::npos) << "names where";
 }
 
@@ -293,35 +258,30 @@ TEST(PropertyList, HostileBinaryListsAreRefusedAndHonestOnesRead) {
     }
     exponential.push_back(kTrueObject);
     const qm::Bytes twoKeys{0xD2, 1, 2, 3, 3};
-    struct Case {
-        const char* what;
-        qm::Bytes list;
-        int code;  // 0: read as expected
-        Value expected = Value();
-    };
-    const Case cases[] = {
+    // {what, the list, the error code (0: read as the value)}
+    const std::tuple<const char*, qm::Bytes, int, Value> cases[] = {
         {"two references to one object", binaryList({arrayObject({1, 1}, 1), kTrueObject}, 1), 0, Value(Array{true, true})},
-        {"a hundred references to one string", binaryList({arrayObject(std::vector<std::uint64_t>(100, 1), 1), {0x51, 'x'}}, 1),
-         0, Value(Array(100, Value("x")))},
+        {"14 references to one string", binaryList({arrayObject(std::vector<std::uint64_t>(14, 1), 1), {0x51, 'x'}}, 1), 0,
+         Value(Array(14, Value("x")))},
         {"a plain key", binaryList({{0xD1, 1, 2}, {0x52, 'a', 'b'}, kTrueObject}, 1), 0, Value(Dictionary{{"ab", true}})},
-        {"a UID", binaryList({arrayObject({1}, 1), {0x80, 0x05}}, 1), qm::plist::kErrorUnsupported},
-        {"a key with NUL", binaryList({{0xD1, 1, 2}, {0x53, 'a', 0, 'b'}, kTrueObject}, 1), qm::plist::kErrorMalformed},
-        {"a UTF-16 key with NUL", binaryList({{0xD1, 1, 2}, {0x62, 0, 'a', 0, 0}, kTrueObject}, 1), qm::plist::kErrorMalformed},
-        {"a key twice", binaryList({twoKeys, {0x51, 'a'}, {0x51, 'a'}, kTrueObject}, 1), qm::plist::kErrorMalformed},
-        {"200000 levels", binaryList(deep, 4), qm::plist::kErrorTooComplex},
-        {"shared exponentially", binaryList(exponential, 1), qm::plist::kErrorTooComplex},
-        {"a cycle", binaryList({arrayObject({1}, 1), arrayObject({0}, 1)}, 1), qm::plist::kErrorMalformed},
-        {"a reference past the end", binaryList({arrayObject({7}, 1)}, 1), qm::plist::kErrorMalformed},
-        {"a top object past the end", binaryList({kTrueObject}, 1, 3), qm::plist::kErrorMalformed},
+        {"a UID", binaryList({arrayObject({1}, 1), {0x80, 0x05}}, 1), qm::plist::kErrorUnsupported, {}},
+        {"a key with NUL", binaryList({{0xD1, 1, 2}, {0x53, 'a', 0, 'b'}, kTrueObject}, 1), qm::plist::kErrorMalformed, {}},
+        {"a UTF-16 key with NUL", binaryList({{0xD1, 1, 2}, {0x62, 0, 'a', 0, 0}, kTrueObject}, 1), qm::plist::kErrorMalformed, {}},
+        {"a key twice", binaryList({twoKeys, {0x51, 'a'}, {0x51, 'a'}, kTrueObject}, 1), qm::plist::kErrorMalformed, {}},
+        {"200000 levels", binaryList(deep, 4), qm::plist::kErrorTooComplex, {}},
+        {"shared exponentially", binaryList(exponential, 1), qm::plist::kErrorTooComplex, {}},
+        {"a cycle", binaryList({arrayObject({1}, 1), arrayObject({0}, 1)}, 1), qm::plist::kErrorMalformed, {}},
+        {"a reference past the end", binaryList({arrayObject({7}, 1)}, 1), qm::plist::kErrorMalformed, {}},
+        {"a top object past the end", binaryList({kTrueObject}, 1, 3), qm::plist::kErrorMalformed, {}},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.what);
-        auto value = qm::plist::parse(c.list);
-        if (c.code == 0) {
+    for (const auto& [what, list, code, expected] : cases) {
+        SCOPED_TRACE(what);
+        auto value = qm::plist::parse(list);
+        if (code == 0) {
             ASSERT_TRUE(value.ok()) << value.error().text();
-            EXPECT_EQ(*value, c.expected);
+            EXPECT_EQ(*value, expected);
         } else {
-            expectRefused(value, c.code);
+            expectRefused(value, code);
         }
     }
 }
@@ -340,11 +300,16 @@ TEST(PropertyList, EveryTruncationOfAValidDocumentIsHandled) {
                 EXPECT_NE(prefix->type(), qm::ValueType::null);
             }
         }
-        EXPECT_EQ(roundTrip(value, format), value);
     }
 }
 
 // --- files ------------------------------------------------------------------
+
+mode_t modeOf(const std::string& path) {
+    struct stat status {};
+    EXPECT_EQ(::stat(path.c_str(), &status), 0) << path;
+    return status.st_mode & 07777;
+}
 
 TEST(PropertyListFile, WritesReplaceTheFileWholeAndKeepItsMode) {
     qmtest::TempDir dir;
@@ -357,13 +322,10 @@ TEST(PropertyListFile, WritesReplaceTheFileWholeAndKeepItsMode) {
         EXPECT_EQ(*back, value);
     }
     EXPECT_EQ(qmtest::readFile(path).rfind("bplist00", 0), 0u);
-    struct stat status {};
-    ASSERT_EQ(::stat(path.c_str(), &status), 0);
-    EXPECT_EQ(status.st_mode & 07777, 0600u) << "a new file is private";
+    EXPECT_EQ(modeOf(path), 0600u) << "a new file is private";
     ASSERT_EQ(::chmod(path.c_str(), 0644), 0);
     ASSERT_FALSE(qm::plist::writeFileAtomically(path, Value(Array{}), Format::xml));
-    ASSERT_EQ(::stat(path.c_str(), &status), 0);
-    EXPECT_EQ(status.st_mode & 07777, 0644u) << "a replaced file keeps its mode";
+    EXPECT_EQ(modeOf(path), 0644u) << "a replaced file keeps its mode";
     // Nothing but the file itself is left in the folder.
     EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.path()), std::filesystem::directory_iterator()), 1);
 

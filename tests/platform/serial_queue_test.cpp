@@ -3,12 +3,10 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
 #include <functional>
 #include <future>
-#include <mutex>
 #include <thread>
 #include <vector>
 
@@ -18,25 +16,14 @@ using qm::SerialQueue;
 
 namespace {
 
+// Holds the queue a job runs on until released.
 struct Gate {
-    std::mutex mutex;
-    std::condition_variable changed;
-    bool open = false;
-    bool entered = false;
+    std::promise<void> entered, released;
+    std::future<void> in = entered.get_future();
+    std::shared_future<void> open = released.get_future().share();
     void enterAndWait() {
-        std::unique_lock lock(mutex);
-        entered = true;
-        changed.notify_all();
-        changed.wait(lock, [&] { return open; });
-    }
-    void waitEntered() {
-        std::unique_lock lock(mutex);
-        changed.wait(lock, [&] { return entered; });
-    }
-    void release() {
-        std::lock_guard lock(mutex);
-        open = true;
-        changed.notify_all();
+        entered.set_value();
+        open.wait();
     }
 };
 
@@ -45,22 +32,19 @@ TEST(SerialQueue, JobsFromManyThreadsRunOneAtATimeInEachThreadsOrder) {
     std::vector<std::pair<int, int>> ran;  // touched only on the queue
     std::atomic<int> concurrent{0};
     std::atomic<bool> overlapped{false};
-    std::vector<std::thread> submitters;
-    for (int t = 0; t < 4; ++t) {
-        submitters.emplace_back([&, t] {
-            for (int i = 0; i < 500; ++i) {
-                queue.async([&, t, i] {
-                    if (concurrent.fetch_add(1) != 0) {
-                        overlapped = true;
-                    }
-                    ran.emplace_back(t, i);
-                    concurrent.fetch_sub(1);
-                });
-            }
-        });
-    }
-    for (auto& s : submitters) {
-        s.join();
+    {
+        std::vector<std::jthread> submitters;
+        for (int t = 0; t < 4; ++t) {
+            submitters.emplace_back([&, t] {
+                for (int i = 0; i < 500; ++i) {
+                    queue.async([&, t, i] {
+                        overlapped = overlapped || concurrent.fetch_add(1) != 0;
+                        ran.emplace_back(t, i);
+                        concurrent.fetch_sub(1);
+                    });
+                }
+            });
+        }
     }
     queue.sync([] {});
     EXPECT_FALSE(overlapped);
@@ -81,11 +65,7 @@ TEST(SerialQueue, NestingsTheLockOrderAllowsNeverDeadlock) {
         SerialQueue z{"z", qm::QualityOfService::standard, /*runsInlineWhenIdle=*/true};
     };
     using Finish = std::function<void()>;
-    struct Nesting {
-        const char* name;
-        std::function<void(Queues&, Finish)> run;
-    };
-    const Nesting nestings[] = {
+    const std::pair<const char*, std::function<void(Queues&, Finish)>> nestings[] = {
         {"X.sync -> Y.async -> X.sync",
          [](Queues& q, Finish finish) { q.x.sync([&q, finish] { q.y.async([&q, finish] { q.x.sync(finish); }); }); }},
         {"X.async -> Y.async -> X.sync",
@@ -98,24 +78,33 @@ TEST(SerialQueue, NestingsTheLockOrderAllowsNeverDeadlock) {
              });
          }},
         {"X.sync -> Y.sync -> Z.async -> Y.sync",
-         [](Queues& q, Finish finish) { q.x.sync([&q, finish] { q.y.sync([&q, finish] { q.z.async([&q, finish] { q.y.sync(finish); }); }); }); }},
+         [](Queues& q, Finish finish) {
+             q.x.sync([&q, finish] { q.y.sync([&q, finish] { q.z.async([&q, finish] { q.y.sync(finish); }); }); });
+         }},
         {"X.async -> Y.sync -> X.async",
          [](Queues& q, Finish finish) { q.x.async([&q, finish] { q.y.sync([&q, finish] { q.x.async(finish); }); }); }},
     };
-    for (const Nesting& nesting : nestings) {
-        SCOPED_TRACE(nesting.name);
+    for (const auto& [name, run] : nestings) {
+        SCOPED_TRACE(name);
         Queues queues;
-        std::promise<void> finished;
-        auto ran = finished.get_future();
-        std::thread runner([&] { nesting.run(queues, [&] { finished.set_value(); }); });
-        if (ran.wait_for(std::chrono::seconds(10)) != std::future_status::ready) {
-            std::fprintf(stderr, "deadlock: %s\n", nesting.name);
-            std::_Exit(1);
+        // The queues go only once the nesting has returned: the thread that
+        // ran it inline still touches them after the innermost job.
+        std::promise<void> finished, returned;
+        std::future<void> waits[] = {finished.get_future(), returned.get_future()};
+        std::thread runner([&, &run = run] {
+            run(queues, [&] { finished.set_value(); });
+            returned.set_value();
+        });
+        for (auto& wait : waits) {
+            if (wait.wait_for(std::chrono::seconds(10)) != std::future_status::ready) {
+                std::fprintf(stderr, "deadlock: %s\n", name);
+                std::_Exit(1);
+            }
         }
-        runner.join();  // it may still be leaving a queue it ran on
-        queues.x.sync([] {});
-        queues.y.sync([] {});
-        queues.z.sync([] {});
+        runner.join();
+        for (SerialQueue* queue : {&queues.x, &queues.y, &queues.z}) {
+            queue->sync([] {});
+        }
     }
 }
 
@@ -135,25 +124,7 @@ TEST(SerialQueue, AJobOnAQueueNeverRunsAnotherQueuesAsyncJobInline) {
     EXPECT_FALSE(outerCurrentInsideSync);
 }
 
-TEST(SerialQueue, SyncWaitsBehindQueuedWork) {
-    SerialQueue queue("behind");
-    Gate gate;
-    std::vector<int> order;
-    queue.async([&] {
-        gate.enterAndWait();
-        order.push_back(1);
-    });
-    gate.waitEntered();
-    queue.async([&] { order.push_back(2); });
-    std::thread releaser([&] {
-        std::this_thread::sleep_for(std::chrono::milliseconds(20));
-        gate.release();
-    });
-    queue.sync([&] { order.push_back(3); });
-    releaser.join();
-    EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
-}
-
+// A sync() call waits behind the work already queued.
 TEST(SerialQueue, AnIdleInlineQueueRunsOnTheCallerAndABusyOneOnItsWorker) {
     SerialQueue queue("inline", qm::QualityOfService::userInitiated, /*runsInlineWhenIdle=*/true);
     std::thread::id ranOn;
@@ -169,17 +140,19 @@ TEST(SerialQueue, AnIdleInlineQueueRunsOnTheCallerAndABusyOneOnItsWorker) {
             order.push_back(1);
         });
     });
-    gate.waitEntered();
+    gate.in.wait();
     EXPECT_TRUE(queue.busy());
     std::thread::id secondRanOn;
     queue.async([&] {
         secondRanOn = std::this_thread::get_id();
         order.push_back(2);
     });
-    queue.async([&] { order.push_back(3); });
-    gate.release();
+    std::jthread releaser([&] {
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+        gate.released.set_value();
+    });
+    queue.sync([&] { order.push_back(3); });
     holder.join();
-    queue.sync([] {});
     EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
     EXPECT_NE(secondRanOn, std::this_thread::get_id());
     EXPECT_NE(secondRanOn, std::thread::id());
@@ -188,14 +161,14 @@ TEST(SerialQueue, AnIdleInlineQueueRunsOnTheCallerAndABusyOneOnItsWorker) {
 TEST(SerialQueue, PendingJobsRunBeforeTheQueueGoes) {
     std::atomic<int> count{0};
     {
+        Gate gate;  // outlives the queue, whose worker waits on it
         SerialQueue queue("drain");
-        Gate gate;
         queue.async([&] { gate.enterAndWait(); });
-        gate.waitEntered();
+        gate.in.wait();
         for (int i = 0; i < 100; ++i) {
             queue.async([&] { count.fetch_add(1); });
         }
-        gate.release();
+        gate.released.set_value();
     }
     EXPECT_EQ(count.load(), 100);
 }

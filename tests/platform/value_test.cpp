@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <limits>
+#include <tuple>
 
 #include "platform/value/Value.h"
 
@@ -44,15 +45,21 @@ TEST(Value, DictionariesKeepKeysSortedAndRefuseDuplicatesWhenBuilt) {
     EXPECT_EQ(built->find("d"), nullptr);
 }
 
-TEST(Value, ChangingADictionarySharesTheUntouchedEntriesAndLeavesTheOriginal) {
-    Value nested(Dictionary{{"deep", Value(Array{1, 2, 3})}});
-    Dictionary original{{"keep", nested}, {"drop", 1}};
-    Dictionary changed = original.changing("drop", std::nullopt).changing("add", Value("x"));
-    EXPECT_TRUE(original.contains("drop"));
-    EXPECT_FALSE(original.contains("add"));
-    EXPECT_FALSE(changed.contains("drop"));
-    EXPECT_EQ(*changed.find("add"), Value("x"));
-    EXPECT_TRUE(changed.find("keep")->isSameObject(*original.find("keep")));
+TEST(Value, ChangingADictionaryGivesACopySharingTheEntriesItLeaves) {
+    Value list(Array{1, 2});
+    const Dictionary original{{"a", 1}, {"list", list}};
+    const std::tuple<const char*, std::optional<Value>, Dictionary> cases[] = {
+        {"b", Value("two"), Dictionary{{"a", 1}, {"b", "two"}, {"list", list}}},
+        {"a", Value(2), Dictionary{{"a", 2}, {"list", list}}},
+        {"a", std::nullopt, Dictionary{{"list", list}}},
+        {"zzz", std::nullopt, original},  // removing what is not there is a plain copy
+    };
+    for (const auto& [key, value, expected] : cases) {
+        Dictionary changed = original.changing(key, value);
+        EXPECT_EQ(changed, expected) << key;
+        EXPECT_TRUE(changed.find("list")->isSameObject(list)) << key;
+    }
+    EXPECT_EQ(original, (Dictionary{{"a", 1}, {"list", list}})) << "the receiver keeps its entries";
 }
 
 TEST(Value, EqualityIsDeepAndTypeAware) {

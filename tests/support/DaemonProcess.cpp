@@ -7,103 +7,82 @@
 
 #include <gtest/gtest.h>
 
+#include <array>
 #include <filesystem>
-#include <thread>
 
+#include "support/Eventually.h"
 #include "support/FramePeer.h"
 
 namespace qmtest {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
-std::vector<std::string> mergedEnvironment(const std::map<std::string, std::string>& extra) {
-    std::map<std::string, std::string> all;
-    for (char** e = environ; *e != nullptr; ++e) {
-        std::string entry(*e);
-        auto eq = entry.find('=');
-        if (eq != std::string::npos) {
-            all[entry.substr(0, eq)] = entry.substr(eq + 1);
-        }
-    }
+// Starts the program with `extra` added to (or replacing) the test's own
+// environment, its standard streams on the given descriptors (-1: the test's).
+pid_t spawn(std::vector<std::string> argv, const std::map<std::string, std::string>& extra, std::array<int, 3> streams) {
+    std::vector<std::string> environment;
     for (const auto& [k, v] : extra) {
-        all[k] = v;
+        environment.push_back(k + "=" + v);
     }
-    std::vector<std::string> out;
-    for (const auto& [k, v] : all) {
-        out.push_back(k + "=" + v);
+    for (char** e = environ; *e != nullptr; ++e) {
+        if (std::string entry(*e); !extra.contains(entry.substr(0, entry.find('=')))) {
+            environment.push_back(entry);
+        }
     }
-    return out;
+    std::vector<char*> argp, envp;
+    for (auto& a : argv) {
+        argp.push_back(a.data());
+    }
+    for (auto& e : environment) {
+        envp.push_back(e.data());
+    }
+    argp.push_back(nullptr);
+    envp.push_back(nullptr);
+    pid_t pid = ::fork();
+    if (pid == 0) {
+        for (int fd = 0; fd < 3; ++fd) {
+            if (streams[static_cast<std::size_t>(fd)] >= 0) {
+                ::dup2(streams[static_cast<std::size_t>(fd)], fd);
+            }
+        }
+        ::execve(argp[0], argp.data(), envp.data());
+        ::_exit(127);
+    }
+    return pid;
 }
 
-std::vector<char*> pointers(std::vector<std::string>& strings) {
-    std::vector<char*> out;
-    for (auto& s : strings) {
-        out.push_back(s.data());
-    }
-    out.push_back(nullptr);
-    return out;
-}
-
+// The wait status once the process has ended, or nothing after the timeout.
 std::optional<int> waitPid(pid_t pid, std::chrono::milliseconds timeout) {
-    auto deadline = Clock::now() + timeout;
-    for (;;) {
-        int status = 0;
-        pid_t r = ::waitpid(pid, &status, WNOHANG);
-        if (r == pid) {
-            return status;
-        }
-        if (r < 0 || Clock::now() > deadline) {
-            return std::nullopt;
-        }
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
+    int status = 0;
+    pid_t ended = 0;
+    eventually([&] { return (ended = ::waitpid(pid, &status, WNOHANG)) != 0; }, timeout);
+    return ended == pid ? std::optional(status) : std::nullopt;
+}
+
+int openForWriting(const std::string& path) {
+    return ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
 }
 
 }  // namespace
 
-DaemonProcess::DaemonProcess(DaemonOptions options) : serviceName_(options.serviceName) {
-    runtimeDirectory_ = scratch_.file("duct");
-    logPath_ = scratch_.file("qmd.log");
-    std::map<std::string, std::string> env = {
-        {"QM_DUCT_DIR", runtimeDirectory_},
-        {"QM_LOG_STDERR", "1"},
-        {"XDG_DATA_HOME", scratch_.file("data")},
-        {"XDG_CONFIG_HOME", scratch_.file("config")},
-        {"XDG_STATE_HOME", scratch_.file("state")},
-    };
-    for (const auto& [k, v] : options.environment) {
-        env[k] = v;
-    }
+DaemonProcess::DaemonProcess(std::vector<std::string> arguments, const std::map<std::string, std::string>& environment,
+                             std::string serviceName)
+    : serviceName_(std::move(serviceName)) {
+    std::map<std::string, std::string> env = environment;
+    env.merge(std::map<std::string, std::string>{{"QM_DUCT_DIR", scratch_.file("duct")}, {"QM_LOG_STDERR", "1"},
+                                                 {"XDG_DATA_HOME", scratch_.file("data")},
+                                                 {"XDG_CONFIG_HOME", scratch_.file("config")},
+                                                 {"XDG_STATE_HOME", scratch_.file("state")}});
     runtimeDirectory_ = env["QM_DUCT_DIR"];
-    std::vector<std::string> argv = {QMD_BINARY_PATH, "-S", serviceName_};
-    argv.insert(argv.end(), options.arguments.begin(), options.arguments.end());
-    auto envStrings = mergedEnvironment(env);
-    auto argvPointers = pointers(argv);
-    auto envPointers = pointers(envStrings);
-
-    int logFd = ::open(logPath_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-    EXPECT_GE(logFd, 0);
-    pid_ = ::fork();
-    if (pid_ == 0) {
-        ::dup2(logFd, STDERR_FILENO);
-        ::execve(argvPointers[0], argvPointers.data(), envPointers.data());
-        ::_exit(127);
-    }
+    logPath_ = scratch_.file("qmd.log");
+    arguments.insert(arguments.begin(), {QMD_BINARY_PATH, "-S", serviceName_});
+    int logFd = openForWriting(logPath_);
+    pid_ = spawn(arguments, env, {-1, -1, logFd});
     ::close(logFd);
-    auto deadline = Clock::now() + std::chrono::seconds(10);
-    while (Clock::now() < deadline) {
-        if (FramePeer::canConnect(socketPath())) {
-            return;
-        }
-        if (!running()) {
-            ADD_FAILURE() << "qmd exited during start-up: " << log();
-            return;
-        }
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    eventually([&] { return FramePeer::canConnect(socketPath()) || !running(); }, std::chrono::seconds(10));
+    if (!FramePeer::canConnect(socketPath())) {
+        ADD_FAILURE() << "qmd did not listen within 10 s, or exited: " << log();
     }
-    ADD_FAILURE() << "qmd did not listen within 10 s: " << log();
 }
 
 DaemonProcess::~DaemonProcess() {
@@ -118,14 +97,7 @@ std::string DaemonProcess::log() const {
 }
 
 bool DaemonProcess::waitForLog(const std::string& text, std::chrono::milliseconds timeout) const {
-    auto deadline = Clock::now() + timeout;
-    do {
-        if (log().find(text) != std::string::npos) {
-            return true;
-        }
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    } while (Clock::now() < deadline);
-    return false;
+    return eventually([&] { return log().find(text) != std::string::npos; }, timeout);
 }
 
 std::optional<int> DaemonProcess::waitForExit(std::chrono::milliseconds timeout) {
@@ -136,48 +108,25 @@ std::optional<int> DaemonProcess::waitForExit(std::chrono::milliseconds timeout)
 }
 
 bool DaemonProcess::running() {
-    if (status_) {
-        return false;
-    }
-    int status = 0;
-    if (::waitpid(pid_, &status, WNOHANG) == pid_) {
-        status_ = status;
-        return false;
-    }
-    return true;
+    return !waitForExit(std::chrono::milliseconds(0));
 }
 
 std::size_t DaemonProcess::openDescriptorCount() const {
-    std::size_t count = 0;
-    std::error_code error;
-    for (auto it = std::filesystem::directory_iterator("/proc/" + std::to_string(pid_) + "/fd", error);
-         it != std::filesystem::directory_iterator(); ++it) {
-        ++count;
-    }
-    return count;
+    std::error_code error;  // a daemon that is gone has none
+    auto entries = std::filesystem::directory_iterator("/proc/" + std::to_string(pid_) + "/fd", error);
+    return static_cast<std::size_t>(std::distance(entries, std::filesystem::directory_iterator()));
 }
 
-ProgramResult runProgram(const std::vector<std::string>& argvIn, const std::map<std::string, std::string>& environment,
+ProgramResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& environment,
                          std::chrono::milliseconds timeout, const std::string& standardInput) {
     TempDir scratch;
-    std::string inPath = scratch.file("in");
-    std::string outPath = scratch.file("out");
-    std::string errPath = scratch.file("err");
-    writeFile(inPath, standardInput);
-    auto argv = argvIn;
-    auto envStrings = mergedEnvironment(environment);
-    auto argvPointers = pointers(argv);
-    auto envPointers = pointers(envStrings);
-    pid_t pid = ::fork();
-    if (pid == 0) {
-        int out = ::open(outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int err = ::open(errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int in = ::open(inPath.c_str(), O_RDONLY);
-        ::dup2(out, STDOUT_FILENO);
-        ::dup2(err, STDERR_FILENO);
-        ::dup2(in, STDIN_FILENO);
-        ::execve(argvPointers[0], argvPointers.data(), envPointers.data());
-        ::_exit(127);
+    writeFile(scratch.file("in"), standardInput);
+    int in = ::open(scratch.file("in").c_str(), O_RDONLY | O_CLOEXEC);
+    int out = openForWriting(scratch.file("out"));
+    int err = openForWriting(scratch.file("err"));
+    pid_t pid = spawn(argv, environment, {in, out, err});
+    for (int fd : {in, out, err}) {
+        ::close(fd);
     }
     ProgramResult result;
     auto status = waitPid(pid, timeout);
@@ -188,8 +137,8 @@ ProgramResult runProgram(const std::vector<std::string>& argvIn, const std::map<
     } else if (WIFEXITED(*status)) {
         result.exitStatus = WEXITSTATUS(*status);
     }
-    result.out = readFile(outPath);
-    result.err = readFile(errPath);
+    result.out = readFile(scratch.file("out"));
+    result.err = readFile(scratch.file("err"));
     return result;
 }
 

@@ -14,27 +14,12 @@
 
 namespace qmtest {
 
-struct DaemonOptions {
-    std::vector<std::string> arguments;              // after the program name
-    std::map<std::string, std::string> environment;  // added to (or replacing) the test's own
-    std::string serviceName = "qmtest.qmd";
-};
-
-inline DaemonOptions withArguments(std::vector<std::string> arguments) {
-    DaemonOptions options;
-    options.arguments = std::move(arguments);
-    return options;
-}
-
-inline DaemonOptions withEnvironment(std::map<std::string, std::string> environment) {
-    DaemonOptions options;
-    options.environment = std::move(environment);
-    return options;
-}
-
 class DaemonProcess {
 public:
-    explicit DaemonProcess(DaemonOptions options = {});
+    // `arguments` follow the program name and -S; `environment` is added to
+    // (or replaces) the test's own.
+    explicit DaemonProcess(std::vector<std::string> arguments = {}, const std::map<std::string, std::string>& environment = {},
+                           std::string serviceName = "qmtest.qmd");
     ~DaemonProcess();
     DaemonProcess(const DaemonProcess&) = delete;
     DaemonProcess& operator=(const DaemonProcess&) = delete;

@@ -17,49 +17,44 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-std::optional<sockaddr_un> addressOf(const std::string& path) {
+// A stream socket, bound to the path or connected to it; invalid when that fails.
+qm::UniqueFd socketAt(const std::string& path, bool bound) {
+    qm::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     if (path.size() >= sizeof address.sun_path) {
-        return std::nullopt;
-    }
-    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-    return address;
-}
-
-qm::UniqueFd connectTo(const std::string& path) {
-    qm::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    auto address = addressOf(path);
-    if (!address || ::connect(fd.get(), reinterpret_cast<sockaddr*>(&*address), sizeof *address) != 0) {
         return {};
     }
-    return fd;
+    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+    auto* generic = reinterpret_cast<sockaddr*>(&address);
+    bool ok = bound ? ::bind(fd.get(), generic, sizeof address) == 0 && ::listen(fd.get(), 16) == 0
+                    : ::connect(fd.get(), generic, sizeof address) == 0;
+    return ok ? std::move(fd) : qm::UniqueFd();
 }
 
-std::chrono::milliseconds left(Clock::time_point deadline) {
-    return std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now());
+// Whether the socket has something to read (or an end) before the deadline.
+bool readable(int fd, Clock::time_point deadline) {
+    auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now()).count();
+    pollfd p{fd, POLLIN, 0};
+    return left > 0 && ::poll(&p, 1, static_cast<int>(left)) > 0;
 }
 
 }  // namespace
 
-FramePeer::FramePeer(const std::string& socketPath) : socket_(connectTo(socketPath)) {}
+FramePeer::FramePeer(const std::string& socketPath) : socket_(socketAt(socketPath, false)) {}
 
 bool FramePeer::canConnect(const std::string& socketPath) {
-    return connectTo(socketPath).valid();
+    return socketAt(socketPath, false).valid();
 }
 
 qm::UniqueFd FramePeer::listenAt(const std::string& socketPath) {
-    qm::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    auto address = addressOf(socketPath);
-    EXPECT_TRUE(address) << socketPath;
-    EXPECT_EQ(::bind(fd.get(), reinterpret_cast<sockaddr*>(&*address), sizeof *address), 0) << std::strerror(errno);
-    EXPECT_EQ(::listen(fd.get(), 16), 0);
+    qm::UniqueFd fd = socketAt(socketPath, true);
+    EXPECT_TRUE(fd.valid()) << socketPath << ": " << std::strerror(errno);
     return fd;
 }
 
 FramePeer FramePeer::accept(const qm::UniqueFd& listener) {
-    pollfd p{listener.get(), POLLIN, 0};
-    EXPECT_EQ(::poll(&p, 1, 5000), 1) << "nobody connected";
+    EXPECT_TRUE(readable(listener.get(), Clock::now() + std::chrono::seconds(5))) << "nobody connected";
     return FramePeer(qm::UniqueFd(::accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC)));
 }
 
@@ -76,38 +71,26 @@ bool FramePeer::reply(std::uint64_t id, const qm::Value& body) {
 }
 
 bool FramePeer::sendBytes(const qm::Bytes& bytes) {
-    std::size_t sent = 0;
-    while (sent < bytes.size()) {
+    for (std::size_t sent = 0; sent < bytes.size();) {
         ssize_t n = ::send(socket_.get(), bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
+        if (n < 0 && errno != EINTR) {
             return false;
         }
-        sent += static_cast<std::size_t>(n);
+        sent += n > 0 ? static_cast<std::size_t>(n) : 0;
     }
     return true;
 }
 
 bool FramePeer::readExactly(std::uint8_t* into, std::size_t size, Clock::time_point deadline) {
-    std::size_t got = 0;
-    while (got < size) {
-        pollfd p{socket_.get(), POLLIN, 0};
-        if (left(deadline).count() <= 0) {
+    for (std::size_t got = 0; got < size;) {
+        if (!readable(socket_.get(), deadline)) {
             return false;
-        }
-        if (::poll(&p, 1, static_cast<int>(left(deadline).count())) <= 0) {
-            continue;
         }
         ssize_t n = ::recv(socket_.get(), into + got, size - got, 0);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
+        if (n == 0 || (n < 0 && errno != EINTR)) {
             return false;
         }
-        got += static_cast<std::size_t>(n);
+        got += n > 0 ? static_cast<std::size_t>(n) : 0;
     }
     return true;
 }
@@ -124,16 +107,13 @@ std::optional<Frame> FramePeer::receive(std::chrono::milliseconds timeout) {
         return std::nullopt;
     }
     auto body = qm::cbor::decode(payload);
-    if (!body) {
-        return std::nullopt;
-    }
-    return Frame{h.kind, h.messageId, std::move(body).value()};
+    return body ? std::optional(Frame{h.kind, h.messageId, std::move(body).value()}) : std::nullopt;
 }
 
 std::optional<qm::Value> FramePeer::roundTrip(const qm::Value& message, std::chrono::milliseconds timeout) {
     std::uint64_t id = send(message);
     auto deadline = Clock::now() + timeout;
-    while (auto frame = receive(std::max(left(deadline), std::chrono::milliseconds(0)))) {
+    while (auto frame = receive(std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now()))) {
         if (frame->id == id) {
             return frame->body;
         }
@@ -142,13 +122,8 @@ std::optional<qm::Value> FramePeer::roundTrip(const qm::Value& message, std::chr
 }
 
 bool FramePeer::waitForClose(std::chrono::milliseconds timeout) {
-    auto deadline = Clock::now() + timeout;
     std::uint8_t buffer[65536];
-    while (Clock::now() < deadline) {
-        pollfd p{socket_.get(), POLLIN, 0};
-        if (::poll(&p, 1, 20) <= 0) {
-            continue;
-        }
+    for (auto deadline = Clock::now() + timeout; readable(socket_.get(), deadline);) {
         ssize_t n = ::recv(socket_.get(), buffer, sizeof buffer, 0);
         if (n == 0 || (n < 0 && errno != EINTR && errno != EAGAIN)) {
             return true;

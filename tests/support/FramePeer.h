@@ -40,7 +40,6 @@ public:
     bool reply(std::uint64_t id, const qm::Value& body);
     // Bytes as they are; false when the socket refused them.
     bool sendBytes(const qm::Bytes& bytes);
-    bool sendBytes(std::string_view bytes) { return sendBytes(qm::Bytes(bytes.begin(), bytes.end())); }
 
     // The next frame, or nothing on timeout, on a closed connection or on a
     // payload that does not decode.

@@ -1,14 +1,14 @@
 #pragma once
 // Collects every system-log line written in this process while it lives.
 
-#include <chrono>
+#include <algorithm>
 #include <mutex>
 #include <string>
 #include <string_view>
-#include <thread>
 #include <vector>
 
 #include "platform/log/SystemLog.h"
+#include "support/Eventually.h"
 
 namespace qmtest {
 
@@ -37,21 +37,12 @@ public:
     }
     bool contains(const std::string& needle) const { return text().find(needle) != std::string::npos; }
     std::size_t countContaining(const std::string& needle) const {
-        std::size_t count = 0;
-        for (const auto& line : lines()) {
-            count += line.find(needle) != std::string::npos ? 1 : 0;
-        }
-        return count;
+        auto all = lines();
+        return std::count_if(all.begin(), all.end(), [&](const auto& line) { return line.find(needle) != std::string::npos; });
     }
     // Waits up to five seconds for a line holding the text.
     bool waitFor(const std::string& needle) const {
-        for (int i = 0; i < 500; ++i) {
-            if (contains(needle)) {
-                return true;
-            }
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        }
-        return false;
+        return eventually([&] { return contains(needle); });
     }
 
 private:

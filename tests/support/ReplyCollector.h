@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
 #include <condition_variable>
 #include <functional>
@@ -41,27 +42,27 @@ public:
         std::unique_lock lock(mutex_);
         return changed_.wait_for(lock, timeout, [&] { return replies_.size() >= count; });
     }
-    bool waitForEvents(std::size_t count, std::chrono::milliseconds timeout = std::chrono::seconds(5)) {
+    bool waitForEvents(std::size_t count) {
         std::unique_lock lock(mutex_);
-        return changed_.wait_for(lock, timeout, [&] { return events_.size() >= count; });
+        return changed_.wait_for(lock, std::chrono::seconds(5), [&] { return events_.size() >= count; });
     }
 
     qm::Result<qm::Value> reply(int tag) {
         std::lock_guard lock(mutex_);
-        for (const auto& [t, reply] : replies_) {
-            if (t == tag) {
-                return reply;
-            }
-        }
-        ADD_FAILURE() << "no reply for " << tag;
-        return qm::Error{"test", 0, "missing"};
+        auto it = std::find_if(replies_.begin(), replies_.end(), [&](const auto& entry) { return entry.first == tag; });
+        return it != replies_.end() ? it->second
+                                    : qm::Result<qm::Value>(qm::Error{"test", 0, "no reply for " + std::to_string(tag)});
+    }
+    // The reply's value; null (and a failure) when it is an error.
+    qm::Value value(int tag) {
+        auto result = reply(tag);
+        EXPECT_TRUE(result.ok()) << result.error().text();
+        return result.ok() ? *result : qm::Value();
     }
     std::vector<int> order() {
         std::lock_guard lock(mutex_);
         std::vector<int> tags;
-        for (const auto& entry : replies_) {
-            tags.push_back(entry.first);
-        }
+        std::transform(replies_.begin(), replies_.end(), std::back_inserter(tags), [](const auto& entry) { return entry.first; });
         return tags;
     }
     std::vector<qm::Error> events() {

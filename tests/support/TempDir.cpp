@@ -5,15 +5,12 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
+#include <iterator>
 
 namespace qmtest {
 
-TempDir::TempDir() {
-    std::string pattern = (std::filesystem::temp_directory_path() / "qmtest-XXXXXX").string();
-    char* made = ::mkdtemp(pattern.data());
-    EXPECT_NE(made, nullptr);
-    path_ = pattern;
+TempDir::TempDir() : path_((std::filesystem::temp_directory_path() / "qmtest-XXXXXX").string()) {
+    EXPECT_NE(::mkdtemp(path_.data()), nullptr);
 }
 
 TempDir::~TempDir() {
@@ -28,11 +25,15 @@ void writeFile(const std::string& path, const std::string& text) {
     EXPECT_TRUE(out.good()) << path;
 }
 
+void writePlist(const std::string& path, const qm::Value& value, qm::plist::Format format) {
+    std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+    auto error = qm::plist::writeFileAtomically(path, value, format);
+    EXPECT_FALSE(error) << path << ": " << error->text();
+}
+
 std::string readFile(const std::string& path) {
     std::ifstream in(path, std::ios::binary);
-    std::stringstream text;
-    text << in.rdbuf();
-    return text.str();
+    return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
 }
 
 }  // namespace qmtest

@@ -3,6 +3,8 @@
 
 #include <string>
 
+#include "platform/plist/PropertyList.h"
+
 namespace qmtest {
 
 class TempDir {
@@ -22,5 +24,8 @@ private:
 // Writes text to a file (creating parent directories); asserts on failure.
 void writeFile(const std::string& path, const std::string& text);
 std::string readFile(const std::string& path);
+// Writes a property list, replacing the file by rename (creating parent
+// directories); a failure is a test failure.
+void writePlist(const std::string& path, const qm::Value& value, qm::plist::Format format = qm::plist::Format::xml);
 
 }  // namespace qmtest

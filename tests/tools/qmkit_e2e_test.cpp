@@ -1,46 +1,30 @@
-// qmkit end to end: its output and exit statuses against a real qmd.
-
-#include <signal.h>
-#include <sys/socket.h>
-#include <sys/un.h>
+// qmkit end to end: its output and exit statuses against a real qmd, and
+// offline, "inspect" on the example bundles. What the model makes of each
+// bundle is the model's tests' business.
 
 #include <gtest/gtest.h>
 
-#include <cstring>
 #include <thread>
+#include <tuple>
 
-#include "platform/fd/UniqueFd.h"
+#include "model/ModelTestSupport.h"
 #include "platform/value/Json.h"
 #include "support/DaemonProcess.h"
+#include "support/FramePeer.h"
 
+using modeltest::at;
+using modeltest::ScopedEnvironment;
+using qm::Value;
 using qmtest::DaemonProcess;
+using qmtest::FramePeer;
 using qmtest::ProgramResult;
 using qmtest::runProgram;
 
 namespace {
 
-using namespace std::chrono_literals;
-
-class Qmkit : public ::testing::Test {
-protected:
-    ProgramResult qmkit(std::vector<std::string> args, const std::string& input = "") {
-        args.insert(args.begin(), {QMKIT_BINARY_PATH, "-S", daemon_.serviceName()});
-        return runProgram(args, {{"QM_DUCT_DIR", daemon_.runtimeDirectory()}, {"QM_LOG_STDERR", "0"}},
-                          std::chrono::seconds(30), input);
-    }
-
-    DaemonProcess daemon_;
-};
-
 ProgramResult offline(std::vector<std::string> args) {
     args.insert(args.begin(), QMKIT_BINARY_PATH);
     return runProgram(args, {{"QM_LOG_STDERR", "0"}});
-}
-
-qm::Value parseJson(const std::string& text) {
-    auto value = qm::json::parse(text);
-    EXPECT_TRUE(value.ok()) << text;
-    return value.ok() ? *value : qm::Value();
 }
 
 bool startsWith(const std::string& text, const std::string& prefix) {
@@ -49,14 +33,9 @@ bool startsWith(const std::string& text, const std::string& prefix) {
 
 // Runs without a daemon: help, version and every usage error.
 TEST(QmkitUsage, AnswersWithoutADaemon) {
-    struct Case {
-        std::vector<std::string> args;
-        int exitStatus;
-        std::string out;  // how standard output starts; empty: nothing
-        std::string err;  // how standard error starts; empty: nothing
-    };
+    // {arguments, exit status, how standard output starts and how standard error starts (empty: nothing)}
     const std::string kTooLarge = "is too large (at most 18446744073709551615)\n";
-    const Case cases[] = {
+    const std::tuple<std::vector<std::string>, int, std::string, std::string> cases[] = {
         {{"--help"}, 0, "usage: qmkit [-S service] [--json] [--timeout SECONDS] <command>", ""},
         {{"bulk", "--help"}, 0, "usage: qmkit [-S service] [--json] [--timeout SECONDS] bulk [--flags N]", ""},
         {{"send", "--help"}, 0, "usage: qmkit [-S service] [--json] [--timeout SECONDS] send JSON", ""},
@@ -85,93 +64,173 @@ TEST(QmkitUsage, AnswersWithoutADaemon) {
         {{"bulk", "--flags"}, 2, "", "qmkit: bulk: unexpected argument \"--flags\""},
         {{"bulk", "extra"}, 2, "", "qmkit: bulk: unexpected argument \"extra\""},
     };
-    for (const Case& c : cases) {
-        ProgramResult result = offline(c.args);
-        const std::string what = c.args.empty() ? "(no arguments)" : c.args.front() + " ...";
-        EXPECT_EQ(result.exitStatus, c.exitStatus) << what << ": " << result.err;
-        EXPECT_TRUE(startsWith(result.out, c.out)) << what << ": " << result.out;
-        EXPECT_TRUE(startsWith(result.err, c.err)) << what << ": " << result.err;
+    for (const auto& [args, exitStatus, out, err] : cases) {
+        ProgramResult result = offline(args);
+        const std::string what = args.empty() ? "(no arguments)" : args.front() + " ...";
+        EXPECT_EQ(result.exitStatus, exitStatus) << what << ": " << result.err;
+        EXPECT_TRUE(startsWith(result.out, out)) << what << ": " << result.out;
+        EXPECT_TRUE(startsWith(result.err, err)) << what << ": " << result.err;
     }
 }
 
-TEST(QmkitUsage, AnUnreachableDaemonExitsThree) {
+// Without an answer qmkit exits 3: nobody listens, a service takes the
+// connection and never answers (it gives up after its timeout rather than
+// waiting for ever), or a daemon hangs up before replying.
+TEST(QmkitUsage, WithoutAnAnswerItExitsThree) {
     qmtest::TempDir scratch;
-    ProgramResult result =
-        runProgram({QMKIT_BINARY_PATH, "-S", "nobody.qmd", "bulk"}, {{"QM_DUCT_DIR", scratch.path()}, {"QM_LOG_STDERR", "0"}});
-    EXPECT_EQ(result.exitStatus, 3);
-    EXPECT_EQ(result.err, "qmkit: cannot reach qmd (service \"nobody.qmd\"): cannot connect to " +
-                              scratch.file("nobody.qmd") + ": No such file or directory\n");
+    qm::UniqueFd mute = FramePeer::listenAt(scratch.file("mute.qmd"));
+    qm::UniqueFd vanishing = FramePeer::listenAt(scratch.file("vanishing.qmd"));
+    std::thread hangsUp([&] { FramePeer::accept(vanishing).receive(); });
+    const std::pair<const char*, std::string> cases[] = {
+        {"nobody.qmd", "qmkit: cannot reach qmd (service \"nobody.qmd\"): cannot connect to " + scratch.file("nobody.qmd") +
+                           ": No such file or directory\n"},
+        {"mute.qmd", "qmkit: no reply within 0.5 s\n"},
+        {"vanishing.qmd", "qmkit: connection invalid: daemon closed the connection\n"},
+    };
+    for (const auto& [service, err] : cases) {
+        ProgramResult result = runProgram({QMKIT_BINARY_PATH, "-S", service, "--timeout", "0.5", "bulk"},
+                                          {{"QM_DUCT_DIR", scratch.path()}, {"QM_LOG_STDERR", "0"}});
+        EXPECT_EQ(result.exitStatus, 3) << service;
+        EXPECT_EQ(result.err, err);
+        EXPECT_EQ(result.out, "");
+    }
+    hangsUp.join();
 }
 
-// A service that takes connections and never answers: qmkit gives up after
-// its timeout rather than waiting for ever.
-TEST(QmkitUsage, ADaemonThatNeverAnswersTimesOut) {
-    qmtest::TempDir scratch;
-    const std::string path = scratch.file("mute.qmd");
-    qm::UniqueFd listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    ASSERT_TRUE(listener);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    ASSERT_LT(path.size(), sizeof address.sun_path);
-    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-    ASSERT_EQ(::bind(listener.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-    ASSERT_EQ(::listen(listener.get(), 4), 0);
-
-    ProgramResult result = runProgram({QMKIT_BINARY_PATH, "-S", "mute.qmd", "--timeout", "0.2", "bulk"},
-                                      {{"QM_DUCT_DIR", scratch.path()}, {"QM_LOG_STDERR", "0"}});
-    EXPECT_EQ(result.exitStatus, 3);
-    EXPECT_EQ(result.err, "qmkit: no reply within 0.2 s\n");
-    EXPECT_EQ(result.out, "");
+// Replies print as JSON when asked (an error reply too); an error reply
+// exits 1 with its message and code. "send" adds the current version only
+// where it is missing.
+TEST(Qmkit, TheDaemonsRepliesAndRefusals) {
+    DaemonProcess daemon;
+    struct Case {
+        std::vector<std::string> args;
+        std::string input;
+        int exitStatus;
+        std::string out, err;
+        std::string logged = "";
+    };
+    const std::string unrecognized = "qmkit: unrecognized request (code 4)\n";
+    const Case cases[] = {
+        {{"bulk", "--flags", "42"}, "", 0, "", "", "bulk options 0x2a not supported"},
+        {{"--json", "bulk", "--flags", "0x10"}, "", 0, "{}\n", "", "bulk options 0x10 not supported"},
+        {{"send", "-"}, "{\"request\": \"bulk\",\n \"flags\": 7}\n", 0, "{}\n", "", "bulk options 0x7 not supported"},
+        {{"send", "{\"request\": \"bulk\", \"version\": 1}"}, "", 1, "",
+         "qmkit: unsupported protocol version 1 (current 3) (code 7)\n"},
+        {{"send", "{\"request\": \"Add\"}"}, "", 1, "", unrecognized},
+        {{"--json", "send",
+          "{\"request\": \"x-unknown\", \"uuids\": [{\"$uuid\": \"0d3c1f5e-8a51-4c7e-9f6b-2d7f1e0a9b34\"}]}"},
+         "",
+         1, "{\n  \"error\": \"unrecognized request\",\n  \"errorcode\": 4\n}\n", unrecognized},
+    };
+    for (Case c : cases) {
+        c.args.insert(c.args.begin(), {QMKIT_BINARY_PATH, "-S", daemon.serviceName()});
+        ProgramResult result = runProgram(c.args, {{"QM_DUCT_DIR", daemon.runtimeDirectory()}, {"QM_LOG_STDERR", "0"}},
+                                          std::chrono::seconds(30), c.input);
+        EXPECT_EQ(result.exitStatus, c.exitStatus) << c.args.back();
+        EXPECT_EQ(result.out, c.out) << c.args.back();
+        EXPECT_EQ(result.err, c.err) << c.args.back();
+        EXPECT_TRUE(c.logged.empty() || daemon.waitForLog(c.logged)) << c.logged;
+    }
 }
 
-TEST_F(Qmkit, BulkSucceedsQuietlyAndPassesItsFlags) {
-    ProgramResult plain = qmkit({"bulk", "--flags", "42"});
-    EXPECT_EQ(plain.exitStatus, 0) << plain.err;
-    EXPECT_EQ(plain.out, "");
-    EXPECT_EQ(plain.err, "");
-    EXPECT_TRUE(daemon_.waitForLog("bulk options 0x2a not supported"));
+// --- inspect -----------------------------------------------------------------
 
-    ProgramResult json = qmkit({"--json", "bulk", "--flags", "0x10"});
-    EXPECT_EQ(json.exitStatus, 0) << json.err;
-    EXPECT_EQ(parseJson(json.out), qm::Value(qm::Dictionary{}));
-    EXPECT_TRUE(daemon_.waitForLog("bulk options 0x10 not supported"));
+const std::string kExamples = std::string(QM_SOURCE_DIR) + "/examples";
+const std::string kNotes = kExamples + "/Applications/Notes.app/PlugIns/";
+const std::string kStudio = kExamples + "/Applications/Studio.app/Contents/PlugIns/";
+
+class QmkitInspect : public ::testing::Test {
+protected:
+    ProgramResult inspect(std::vector<std::string> arguments, std::map<std::string, std::string> environment = {}) {
+        arguments.insert(arguments.begin(), {QMKIT_BINARY_PATH, "inspect"});
+        environment.merge(std::map<std::string, std::string>{
+            {"QM_SDK_PATH", kExamples + "/SDKs"}, {"XDG_DATA_HOME", dir.file("data")}, {"QM_LOG_STDERR", "0"}});
+        return runProgram(arguments, environment);
+    }
+    Value json(std::vector<std::string> arguments, std::map<std::string, std::string> environment = {}) {
+        arguments.push_back("--json");
+        auto result = inspect(arguments, environment);
+        EXPECT_EQ(result.exitStatus, 0) << result.err;
+        auto parsed = qm::json::parse(result.out);
+        EXPECT_TRUE(parsed.ok()) << result.out;
+        return parsed.ok() ? *parsed : Value();
+    }
+
+    qmtest::TempDir dir;
+    ScopedEnvironment testSdk{"QMTEST_SDK", std::nullopt};
+    ScopedEnvironment systemRoots{"QM_SYSTEM_ROOTS", std::nullopt};
+};
+
+TEST_F(QmkitInspect, ItsOutputAndExitStatus) {
+    struct Case {
+        std::vector<std::string> arguments;
+        int exitStatus;
+        std::vector<std::string> out;  // lines it holds
+        std::string err;               // what it holds; empty: nothing at all
+        std::map<std::string, std::string> environment = {};
+    };
+    const std::string share = kNotes + "ShareToNotes.bundle";
+    const std::string filters = kStudio + "Filters.bundle";
+    const std::string noSdks = dir.file("no-sdks");
+    const std::string usage = "usage: qmkit inspect BUNDLE";
+    const Case cases[] = {
+        {{share}, 0,
+         {"plug-in ovaro.example.notes.share\n", "  path: " + share + "\n",
+          "  containing application: " + kExamples + "/Applications/Notes.app\n", "  system volume: no\n",
+          "  sdk: ovaro.share-services\n", "  protocol: ShareServiceProtocol\n", "  version: 3.1\n",
+          "  hub protocol version: 2\n",
+          "  data container: " + dir.file("data") + "/ovaro/Containers/ovaro.example.notes.share\n", "  valid: yes\n",
+          "CleanTimeout: 30\n"},
+         ""},
+        {{kNotes + "Spelling.bundle"}, 0, {"  data container: none (a data plug-in needs none)\n", "  protocol: #Data\n"}, ""},
+        // The SDKs come from QM_SDK_PATH or --sdk-dir.
+        {{share}, 1, {}, "missing \"VTExtensionProtocol\" key in Info.plist or SDK (code 12)\n", {{"QM_SDK_PATH", noSdks}}},
+        {{share, "--sdk-dir", kExamples + "/SDKs"}, 0, {"  valid: yes\n"}, "", {{"QM_SDK_PATH", noSdks}}},
+        {{kStudio + "Hybrid.bundle"}, 1, {"  valid: no\n"},
+         "qmkit: plug-in ovaro.example.studio.hybrid in " + kStudio +
+             "Hybrid.bundle: hybrid plug-ins are not supported on this platform (code 12)\n"},
+        {{filters, "-i", "ovaro.example.studio.none"}, 1, {},
+         "qmkit: plug-in ovaro.example.studio.none in " + filters +
+             ": malformed plug-in dictionary in plug-in ovaro.example.studio.none at file://"},
+        {{kStudio + "Broken.bundle"}, 1, {},
+         "qmkit: unreadable Info dictionary in plug-in bundle at " + kStudio + "Broken.bundle: "},
+        {{dir.file("Nowhere.bundle")}, 1, {}, "qmkit: no plug-in bundle at " + dir.file("Nowhere.bundle") + " (code 9)\n"},
+        {{}, 2, {}, usage},
+        {{"--frobnicate", share}, 2, {}, usage},
+        {{share, "-i"}, 2, {}, usage},
+        {{share, filters}, 2, {}, usage},
+        {{"--help"}, 0, {usage}, ""},
+    };
+    for (const Case& c : cases) {
+        auto result = inspect(c.arguments, c.environment);
+        SCOPED_TRACE((c.arguments.empty() ? "" : c.arguments.back()) + "\nout:\n" + result.out + "err:\n" + result.err);
+        EXPECT_EQ(result.exitStatus, c.exitStatus);
+        for (const std::string& line : c.out) {
+            EXPECT_NE(result.out.find(line), std::string::npos) << line;
+        }
+        EXPECT_TRUE(c.err.empty() ? result.err.empty() : result.err.find(c.err) != std::string::npos);
+    }
 }
 
-TEST_F(Qmkit, SendAddsTheCurrentVersionOnlyWhenItIsMissing) {
-    ProgramResult added = qmkit({"send", "-"}, "{\"request\": \"bulk\",\n \"flags\": 7}\n");
-    EXPECT_EQ(added.exitStatus, 0) << added.err;
-    EXPECT_EQ(added.out, "{}\n");
-    EXPECT_TRUE(daemon_.waitForLog("bulk options 0x7 not supported"));
+// What the form holds is the model's test; here that it is printed whole.
+TEST_F(QmkitInspect, JsonPrintsTheFormOrEveryFormOfTheBundle) {
+    Value form = json({kNotes + "ShareToNotes.bundle"});
+    EXPECT_EQ(at(form, {"identifier"}), Value("ovaro.example.notes.share"));
+    EXPECT_EQ(at(form, {"systemResident"}), Value(false));
+    EXPECT_EQ(at(form, {"bundleInfo", "VTExtension", "CleanTimeout"}), Value(30));
+    EXPECT_TRUE(at(form, {"uuid"}).asString() && qm::Uuid::parse(*at(form, {"uuid"}).asString()));
 
-    ProgramResult kept = qmkit({"send", "{\"request\": \"bulk\", \"version\": 1}"});
-    EXPECT_EQ(kept.exitStatus, 1);
-    EXPECT_EQ(kept.err, "qmkit: unsupported protocol version 1 (current 3) (code 7)\n");
-    EXPECT_EQ(kept.out, "");
-}
+    Value widget = json({kNotes + "NotesWidget.xbun"}, {{"QM_SYSTEM_ROOTS", kExamples + "/Applications"}});
+    EXPECT_EQ(at(widget, {"systemResident"}), Value(true));
+    EXPECT_EQ(at(widget, {"info", "PrincipalClass"}), Value("VTObject"));
 
-TEST_F(Qmkit, AnErrorReplyExitsOneWithTheMessageAndCode) {
-    ProgramResult plain = qmkit({"send", "{\"request\": \"Add\"}"});
-    EXPECT_EQ(plain.exitStatus, 1);
-    EXPECT_EQ(plain.err, "qmkit: unrecognized request (code 4)\n");
-
-    ProgramResult json = qmkit({"--json", "send", "{\"request\": \"x-unknown\", \"uuids\": "
-                                                  "[{\"$uuid\": \"0d3c1f5e-8a51-4c7e-9f6b-2d7f1e0a9b34\"}]}"});
-    EXPECT_EQ(json.exitStatus, 1);
-    EXPECT_EQ(json.err, "qmkit: unrecognized request (code 4)\n");
-    qm::Value reply = parseJson(json.out);
-    EXPECT_EQ(reply, qm::Value(qm::Dictionary{{"errorcode", 4}, {"error", "unrecognized request"}}));
-}
-
-TEST_F(Qmkit, ADaemonThatDiesBeforeReplyingExitsThree) {
-    ASSERT_EQ(::kill(daemon_.pid(), SIGSTOP), 0);
-    std::thread killer([pid = daemon_.pid()] {
-        std::this_thread::sleep_for(500ms);
-        ::kill(pid, SIGKILL);
-    });
-    ProgramResult result = qmkit({"bulk"});
-    killer.join();
-    EXPECT_EQ(result.exitStatus, 3);
-    EXPECT_EQ(result.err, "qmkit: connection invalid: daemon closed the connection\n");
+    Value forms = json({kStudio + "Filters.bundle"});
+    ASSERT_TRUE(forms.isArray() && forms.asArray()->size() == 2) << forms.description();
+    EXPECT_EQ(at(forms.asArray()->at(0), {"identifier"}), Value("ovaro.example.studio.blur"));
+    EXPECT_EQ(at(forms.asArray()->at(1), {"identifier"}), Value("ovaro.example.studio.sharpen"));
+    Value one = json({kStudio + "Filters.bundle", "-i", "ovaro.example.studio.sharpen"});
+    EXPECT_EQ(at(one, {"identifier"}), Value("ovaro.example.studio.sharpen"));
+    EXPECT_EQ(at(one, {"version"}), Value("1.1"));
 }
 
 }  // namespace
