@@ -53,11 +53,28 @@ struct PendingReply {
 
 }  // namespace
 
+struct QMDaemonClient::Invalidation {
+    std::mutex mutex;
+    InvalidationHandler handler;
+    std::optional<qm::Error> reason;
+};
+
 qm::Result<std::unique_ptr<QMDaemonClient>> QMDaemonClient::initWithServiceName(
     const char* serviceName, std::optional<std::chrono::milliseconds> ioTimeout) {
     std::string name = serviceName ? serviceName : wire::kDefaultServiceName;
     std::unique_ptr<QMDaemonClient> client(new QMDaemonClient());
-    auto onEvent = [](const qm::Error& event) { qm::systemLogf(qm::kLogNotice, "Communications error: %@", event.text()); };
+    auto onEvent = [invalidation = client->invalidation_](const qm::Error& event) {
+        qm::systemLogf(qm::kLogNotice, "Communications error: %@", event.text());
+        InvalidationHandler handler;
+        {
+            std::lock_guard lock(invalidation->mutex);
+            invalidation->reason = event;
+            handler = invalidation->handler;
+        }
+        if (handler) {
+            handler(event);
+        }
+    };
     auto connection = qm::duct::ClientConnection::connect(name, client->replyQueue_, std::move(onEvent),
                                                           qm::duct::ClientConnection::Options{ioTimeout});
     if (!connection) {
@@ -67,11 +84,19 @@ qm::Result<std::unique_ptr<QMDaemonClient>> QMDaemonClient::initWithServiceName(
     return client;
 }
 
-QMDaemonClient::QMDaemonClient() : replyQueue_("qmd_client") {}
+QMDaemonClient::QMDaemonClient() : replyQueue_("qmd_client"), invalidation_(std::make_shared<Invalidation>()) {}
 
 QMDaemonClient::~QMDaemonClient() {
     // The queue's worker cannot join itself.
     assert(!replyQueue_.isCurrent());
+}
+
+void QMDaemonClient::setInvalidationHandler(InvalidationHandler handler) {
+    std::lock_guard lock(invalidation_->mutex);
+    invalidation_->handler = handler;
+    if (invalidation_->reason && handler) {
+        replyQueue_.async([handler, reason = *invalidation_->reason] { handler(reason); });
+    }
 }
 
 QMDaemonClient::Message QMDaemonClient::request(const std::string& name) const {

@@ -44,6 +44,14 @@ public:
 
     qm::SerialQueue& replyQueue() noexcept { return replyQueue_; }
 
+    // Called once, on replyQueue, with the transport error that made the
+    // connection invalid (the daemon hung up or died, a read failed), for
+    // tools that wait without a request pending. Replaces an earlier handler;
+    // set after the connection went, it is called at once (on replyQueue).
+    // Destroying the client does not call it.
+    using InvalidationHandler = std::function<void(const qm::Error& reason)>;
+    void setInvalidationHandler(InvalidationHandler handler);
+
     // The version written into every request; 3 unless changed. A negative
     // version goes out as its 64-bit two's complement.
     std::int64_t protocolVersion() const noexcept { return protocolVersion_.load(); }
@@ -104,9 +112,14 @@ private:
     QMDaemonClient();
     Message requestWithUuids(const std::string& name, const std::vector<qm::Uuid>& uuids) const;
 
+    // Shared with the connection's event handler, which may run on
+    // replyQueue while the client is being destroyed.
+    struct Invalidation;
+
     // Declared first, destroyed last: the connection posts its final
     // handlers to this queue when it goes.
     qm::SerialQueue replyQueue_;
     std::atomic<std::int64_t> protocolVersion_{3};
+    std::shared_ptr<Invalidation> invalidation_;
     std::unique_ptr<qm::duct::ClientConnection> qmd_;
 };

@@ -4,6 +4,9 @@
 
 #include <gtest/gtest.h>
 
+#include <cstring>
+#include <filesystem>
+#include <functional>
 #include <thread>
 #include <tuple>
 
@@ -21,6 +24,58 @@ using qmtest::ProgramResult;
 using qmtest::runProgram;
 
 namespace {
+
+using namespace std::chrono_literals;
+namespace fs = std::filesystem;
+
+// The environment of a daemon over a copy of the example applications.
+std::map<std::string, std::string> withExamples(const qmtest::TempDir& roots) {
+    fs::copy(fs::path(QM_SOURCE_DIR) / "examples/Applications", roots.file("system"), fs::copy_options::recursive);
+    return {{"QM_SYSTEM_ROOTS", roots.file("system")}, {"QM_SDK_PATH", std::string(QM_SOURCE_DIR) + "/examples/SDKs"}};
+}
+
+class Qmkit : public ::testing::Test {
+protected:
+    // Runs qmkit against the daemon; from `directory` when one is given.
+    ProgramResult qmkit(std::vector<std::string> args, const std::string& input = "", const std::string& directory = "") {
+        args.insert(args.begin(), {QMKIT_BINARY_PATH, "-S", daemon_.serviceName()});
+        if (!directory.empty()) {
+            args.insert(args.begin(), {"/bin/sh", "-c", "cd \"$0\" && exec \"$@\"", directory});
+        }
+        return runProgram(args, {{"QM_DUCT_DIR", daemon_.runtimeDirectory()}, {"QM_LOG_STDERR", "0"}},
+                          std::chrono::seconds(30), input);
+    }
+    qm::Value json(std::vector<std::string> args) {
+        args.insert(args.begin(), "--json");
+        ProgramResult result = qmkit(std::move(args));
+        EXPECT_EQ(result.exitStatus, 0) << result.err;
+        auto value = qm::json::parse(result.out);
+        return value.ok() ? *value : qm::Value();
+    }
+    // Asks "holds" until `done` accepts the list (at most 5 s); the last list.
+    qm::Array holdsWhen(const std::function<bool(const qm::Array&)>& done) {
+        qm::Array holds;
+        for (int i = 0; i < 250; ++i, std::this_thread::sleep_for(20ms)) {
+            const qm::Value reply = json({"holds"});
+            const qm::Value* listed = reply.get("holds");
+            holds = listed && listed->asArray() ? *listed->asArray() : qm::Array{};
+            if (done(holds)) {
+                break;
+            }
+        }
+        return holds;
+    }
+    std::string uuidOf(const std::string& identifier) {
+        qm::Value found = json({"send", R"({"request": "match", "rules": {"VTExtensionIdentifier": ")" + identifier + "\"}}"});
+        const qm::Value* matches = found.get("matches");
+        const qm::Value* uuid = matches && matches->asArray() && !matches->asArray()->empty()
+                                    ? matches->asArray()->front().get("uuid") : nullptr;
+        return uuid && uuid->asString() ? *uuid->asString() : "";
+    }
+
+    qmtest::TempDir roots_;
+    DaemonProcess daemon_{{}, withExamples(roots_)};
+};
 
 ProgramResult offline(std::vector<std::string> args) {
     args.insert(args.begin(), QMKIT_BINARY_PATH);
@@ -63,6 +118,14 @@ TEST(QmkitUsage, AnswersWithoutADaemon) {
         {{"bulk", "--flags", "0x10000000000000000"}, 2, "", "qmkit: bulk: --flags 0x10000000000000000 " + kTooLarge},
         {{"bulk", "--flags"}, 2, "", "qmkit: bulk: unexpected argument \"--flags\""},
         {{"bulk", "extra"}, 2, "", "qmkit: bulk: unexpected argument \"extra\""},
+        {{"hold", "--help"}, 0, "usage: qmkit [-S service] [--json] [--timeout SECONDS] hold PATH... [--flags N]", ""},
+        {{"hold", "--flags", "1"}, 2, "", "qmkit: hold: expected one or more paths\nqmkit: see 'qmkit hold --help'\n"},
+        {{"hold", "/a", "--flags", "two"}, 2, "", "qmkit: hold: --flags must be a number (decimal or 0x-hex), not"},
+        {{"hold", "--force", "/a"}, 2, "", "qmkit: hold: unknown option \"--force\""},
+        {{"release", "0d3c1f5e"}, 2, "", "qmkit: release: \"0d3c1f5e\" is not a hold token\n"},
+        {{"access"}, 2, "", "qmkit: access: expected one or more UUIDs\n"},
+        {{"holds", "all"}, 2, "", "qmkit: holds: unexpected argument \"all\"\n"},
+        {{"token", "check", "qm1"}, 2, "", "qmkit: token: expected \"verify TOKEN\"\n"},
     };
     for (const auto& [args, exitStatus, out, err] : cases) {
         ProgramResult result = offline(args);
@@ -100,7 +163,7 @@ TEST(QmkitUsage, WithoutAnAnswerItExitsThree) {
 // Replies print as JSON when asked (an error reply too); an error reply
 // exits 1 with its message and code. "send" adds the current version only
 // where it is missing.
-TEST(Qmkit, TheDaemonsRepliesAndRefusals) {
+TEST(QmkitDaemon, TheDaemonsRepliesAndRefusals) {
     DaemonProcess daemon;
     struct Case {
         std::vector<std::string> args;
@@ -231,6 +294,94 @@ TEST_F(QmkitInspect, JsonPrintsTheFormOrEveryFormOfTheBundle) {
     Value one = json({kStudio + "Filters.bundle", "-i", "ovaro.example.studio.sharpen"});
     EXPECT_EQ(at(one, {"identifier"}), Value("ovaro.example.studio.sharpen"));
     EXPECT_EQ(at(one, {"version"}), Value("1.1"));
+}
+
+// Each way a hold ends; the daemon goes last. Relative paths are the
+// working directory's: the daemon resolves them in its own.
+TEST_F(Qmkit, AHoldLastsUntilReleasedOrInterruptedOrCutOff) {
+    struct Case {
+        const char* ending;
+        int exitStatus;
+        std::string err;
+    };
+    const Case cases[] = {
+        {"release", 0, ""},
+        {"SIGTERM", 0, ""},
+        {"SIGINT", 0, ""},
+        {"daemon killed", 3, "qmkit: connection invalid: daemon closed the connection\n"},
+    };
+    const std::string executable = fs::canonical(QMKIT_BINARY_PATH).string();
+    for (const Case& c : cases) {
+        ProgramResult held;
+        std::thread holder([&] { held = qmkit({"hold", "Notes.app"}, "", roots_.file("system")); });
+        qm::Array holds = holdsWhen([](const qm::Array& listed) { return listed.size() == 1; });
+        if (holds.size() != 1) {
+            holder.join();  // at most runProgram's timeout
+            FAIL() << c.ending << ": the hold is not listed; qmkit said: " << held.err;
+        }
+        const std::string token = *holds[0].get("uuid")->asString();
+        const pid_t pid = static_cast<pid_t>(*holds[0].get("pid")->asSigned());
+        EXPECT_EQ(holds[0].get("plugins")->asArray()->size(), 4u) << c.ending;
+        ProgramResult listed = qmkit({"holds"});
+        EXPECT_TRUE(startsWith(listed.out, "TOKEN")) << listed.out;
+        for (const std::string& cell : {token, " " + std::to_string(pid) + " ", std::string(" 4 "), "  " + executable + "\n"}) {
+            EXPECT_NE(listed.out.find(cell), std::string::npos) << cell << " in " << listed.out;
+        }
+
+        if (c.ending == std::string("release")) {
+            ProgramResult released = qmkit({"release", token});
+            EXPECT_EQ(released.exitStatus, 0) << released.err;
+            EXPECT_EQ(released.out, "");
+        } else {
+            const bool daemon = c.ending == std::string("daemon killed");
+            ::kill(daemon ? daemon_.pid() : pid, daemon ? SIGKILL : c.ending == std::string("SIGINT") ? SIGINT : SIGTERM);
+        }
+        holder.join();
+        EXPECT_EQ(held.exitStatus, c.exitStatus) << c.ending << ": " << held.err;
+        EXPECT_EQ(held.out, token + "\n") << c.ending;
+        EXPECT_EQ(held.err, c.err) << c.ending;
+        if (daemon_.running()) {
+            EXPECT_TRUE(holdsWhen([](const qm::Array& now) { return now.empty(); }).empty()) << c.ending;
+        }
+    }
+}
+
+TEST_F(Qmkit, AccessGrantsTokensThatVerifyAndReadyShowsTheRegistration) {
+    const std::string share = uuidOf("ovaro.example.notes.share");
+    const std::string spelling = uuidOf("ovaro.example.notes.spelling");
+    ASSERT_FALSE(share.empty() || spelling.empty());
+    const qm::Value access = json({"access", spelling, share});
+    const qm::Value* granted = access.get("tokens");
+    ASSERT_TRUE(granted && granted->asArray() && granted->asArray()->size() == 2u);
+    EXPECT_EQ(*(*granted->asArray())[1].get("uuid"), qm::Value(share));
+    const std::string token = *(*granted->asArray())[1].get("token")->asString();
+    ProgramResult table = qmkit({"access", share});
+    EXPECT_EQ(table.out, "UUID" + std::string(34, ' ') + "TOKEN\n" + share + "  " + token + "\n");
+
+    std::string changed = token;
+    changed[token.size() / 2] = changed[token.size() / 2] == '0' ? '1' : '0';
+    const std::string sharePath = fs::canonical(roots_.file("system/Notes.app/PlugIns/ShareToNotes.bundle")).string();
+    qmtest::TempDir keyless;
+    const std::pair<std::string, ProgramResult> verifications[] = {
+        {"genuine", qmkit({"token", "verify", token})},
+        {"changed", qmkit({"token", "verify", changed})},
+        {"no key", runProgram({QMKIT_BINARY_PATH, "token", "verify", token}, {{"QM_DUCT_DIR", keyless.path()}})},
+    };
+    for (const auto& [what, verified] : verifications) {
+        EXPECT_EQ(verified.exitStatus, what == "genuine" ? 0 : 1) << what << ": " << verified.err;
+        EXPECT_EQ(verified.out, what == "genuine" ? "read\t" + sharePath + "\n" : "") << what;
+    }
+    EXPECT_FALSE(fs::exists(keyless.file("token.key"))) << "verifying never creates a key";
+
+    const qm::Value ready = json({"ready", share, spelling});
+    const qm::Value* registrations = ready.get("registrations");
+    ASSERT_TRUE(registrations && registrations->asArray() && registrations->asArray()->size() == 1u)
+        << "a data plug-in needs no registration";
+    const qm::Value& registration = registrations->asArray()->front();
+    EXPECT_EQ(*registration.get("bundle"), qm::Value("ovaro.example.notes.share"));
+    const std::string file = *registration.get("file")->asString();
+    EXPECT_TRUE(startsWith(file, daemon_.runtimeDirectory() + "/services/")) << file;
+    EXPECT_NE(qmtest::readFile(file).find("ovaro.example.notes.share"), std::string::npos) << file;
 }
 
 }  // namespace

@@ -1,5 +1,7 @@
 #include "Command.h"
 
+#include <cstdio>
+
 namespace {
 
 std::vector<QmkitCommand>& registry() {
@@ -15,4 +17,10 @@ const std::vector<QmkitCommand>& qmkitCommands() {
 
 QmkitCommandRegistration::QmkitCommandRegistration(const QmkitCommand& command) {
     registry().push_back(command);
+}
+
+int commandUsageError(const std::string& command, const std::string& message) {
+    std::fprintf(stderr, "qmkit: %s: %s\nqmkit: see 'qmkit %s --help'\n", command.c_str(), message.c_str(),
+                 command.c_str());
+    return kQmkitUsage;
 }

@@ -35,6 +35,10 @@ struct QmkitCommand {
 
 const std::vector<QmkitCommand>& qmkitCommands();
 
+// Writes "qmkit: <command>: <message>" and where to find the command's help
+// on standard error; returns kQmkitUsage.
+int commandUsageError(const std::string& command, const std::string& message);
+
 struct QmkitCommandRegistration {
     explicit QmkitCommandRegistration(const QmkitCommand& command);
 };

@@ -22,28 +22,40 @@ bool timedOut(const qm::Error& error) {
 
 DaemonSession::DaemonSession(const QmkitGlobalOptions& options) : options_(options) {}
 
-int DaemonSession::run(const Start& start, const Printer& printSuccess) const {
-    auto client = QMDaemonClient::initWithServiceName(options_.serviceName.c_str(), options_.timeout);
-    if (!client) {
-        printError("cannot reach qmd (service \"" + options_.serviceName + "\"): " + client.error().text());
-        return kQmkitUnreachable;
+qm::Result<qm::Value, int> DaemonSession::ask(const Start& start) {
+    if (!client_) {
+        auto client = QMDaemonClient::initWithServiceName(options_.serviceName.c_str(), options_.timeout);
+        if (!client) {
+            printError("cannot reach qmd (service \"" + options_.serviceName + "\"): " + client.error().text());
+            return int{kQmkitUnreachable};
+        }
+        client_ = std::move(client).value();
     }
-    QMDaemonClient& qmd = **client;
+    QMDaemonClient& qmd = *client_;
     qm::Result<qm::Value> reply = qmd.waitForReply(
         [&](QMDaemonClient::ReplyHandler handler) { start(qmd, std::move(handler)); }, options_.timeout);
     if (!reply) {
         printError(timedOut(reply.error()) ? "no reply within " + options_.timeoutText + " s" : reply.error().text());
-        return kQmkitUnreachable;
+        return int{kQmkitUnreachable};
     }
-    std::optional<qm::Error> error = QMDaemonClient::errorInReply(reply);
+    if (std::optional<qm::Error> error = QMDaemonClient::errorInReply(reply)) {
+        if (options_.json) {
+            std::fputs(replyAsJson(*reply).c_str(), stdout);
+        }
+        printError(error->text() + " (code " + std::to_string(error->code) + ")");
+        return int{kQmkitDaemonError};
+    }
+    return std::move(reply).value();
+}
+
+int DaemonSession::run(const Start& start, const Printer& printSuccess) {
+    auto reply = ask(start);
+    if (!reply) {
+        return reply.error();
+    }
     if (options_.json) {
         std::fputs(replyAsJson(*reply).c_str(), stdout);
-    }
-    if (error) {
-        printError(error->text() + " (code " + std::to_string(error->code) + ")");
-        return kQmkitDaemonError;
-    }
-    if (!options_.json) {
+    } else {
         printSuccess(*reply);
     }
     return kQmkitOk;
