@@ -8,6 +8,7 @@
 #include "platform/duct/OpenTransaction.h"
 #include "platform/env/Environment.h"
 #include "platform/launcher/ServiceLauncher.h"
+#include "protocol/WireKeys.h"
 
 namespace {
 
@@ -59,18 +60,12 @@ QMDServer* QMDServer::server() {
     return processServer.load();
 }
 
-namespace {
-
-constexpr const char* kAnnotationChange = "ovaro.quamber.annotation-change";
-
-}  // namespace
-
 QMDServer::QMDServer(std::unique_ptr<qm::EventLoop> loop, std::unique_ptr<QMDatabase> registry)
     : loop_(std::move(loop)),
       registry_(std::move(registry)),
       notifications_(qm::ductRuntimeDirectory()),
-      holds_([this] { (void)notifications_.post(kAnnotationChange); }) {
-    registry_->setAnnotationsChanged([this] { (void)notifications_.post(kAnnotationChange); });
+      holds_([this] { (void)notifications_.post(wire::kAnnotationChangeNotification); }) {
+    registry_->setAnnotationsChanged([this] { (void)notifications_.post(wire::kAnnotationChangeNotification); });
     registry_->setDelegate([this](const std::vector<qm::PlugInRecordPtr>& records) { removedPlugIns(records); });
 }
 

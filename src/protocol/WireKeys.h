@@ -28,4 +28,7 @@ inline bool isSupportedVersion(std::uint64_t version) noexcept {
 
 inline constexpr const char* kDefaultServiceName = "ovaro.quamber.qmd";
 
+// Posted after every change of annotations and every hold taken or released.
+inline constexpr const char* kAnnotationChangeNotification = "ovaro.quamber.annotation-change";
+
 }  // namespace wire

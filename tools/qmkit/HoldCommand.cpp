@@ -27,10 +27,11 @@
 #include "platform/notify/NotificationWatcher.h"
 #include "platform/process/TerminationSignals.h"
 #include "platform/queue/EventLoop.h"
+#include "protocol/WireKeys.h"
 
 namespace {
 
-constexpr const char* kHoldsChanged = "ovaro.quamber.annotation-change";
+constexpr const char* kHoldsChanged = wire::kAnnotationChangeNotification;
 constexpr std::uint64_t kHoldApplications = 1;
 
 void help() {
