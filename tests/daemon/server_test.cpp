@@ -15,6 +15,7 @@
 #include "support/FramePeer.h"
 #include "support/ScopedEnvironment.h"
 #include "support/TempDir.h"
+#include "support/TestRegistry.h"
 
 namespace {
 
@@ -50,15 +51,9 @@ protected:
     // The registry's catalog scans an empty root; until `scanned`, it has
     // not even begun.
     void start(bool scanned) {
-        qm::AppCatalogOptions catalogOptions;
-        catalogOptions.databasePath = dir.file("catalog.db");
-        catalogOptions.userRoot = dir.file("Applications");
-        catalogOptions.containersDirectory = dir.file("Containers");
-        auto catalog = qm::AppCatalog::open(catalogOptions);
-        ASSERT_TRUE(catalog) << catalog.error().text();
-        auto registry = QMDatabase::initWithDatabase(dir.file("Annotations"), std::move(catalog).value());
-        ASSERT_TRUE(registry) << registry.error().text();
-        auto created = QMDServer::initForService("inprocess.qmd", std::move(registry).value());
+        auto registry = qmtest::openTestRegistry(dir);
+        ASSERT_TRUE(registry);
+        auto created = QMDServer::initForService("inprocess.qmd", std::move(registry));
         ASSERT_TRUE(created) << created.error().text();
         server = *created;
         server->setVerbose(1);

@@ -11,6 +11,7 @@
 #include "registry/QMDatabase.h"
 #include "support/LogCapture.h"
 #include "support/TempDir.h"
+#include "support/TestRegistry.h"
 
 namespace {
 
@@ -39,16 +40,8 @@ protected:
     }
     void open() {
         fs::create_directories(dir.file("root/Host.app"));
-        qm::AppCatalogOptions options;
-        options.databasePath = dir.file("catalog.db");
-        options.systemRoots = {dir.file("root")};
-        options.userRoot = dir.file("user");
-        options.containersDirectory = dir.file("Containers");
-        auto catalog = qm::AppCatalog::open(options);
-        ASSERT_TRUE(catalog) << catalog.error().text();
-        auto opened = QMDatabase::initWithDatabase(dir.file("Annotations"), std::move(catalog).value());
-        ASSERT_TRUE(opened) << opened.error().text();
-        registry = std::move(opened).value();
+        registry = qmtest::openTestRegistry(dir, {dir.file("root")});
+        ASSERT_TRUE(registry);
         registry->start();
         registry->workspace().waitUntilReady();
     }

@@ -5,6 +5,7 @@
 
 #include <mutex>
 
+#include "platform/file/PathFacts.h"
 #include "platform/log/SystemLog.h"
 #include "platform/plist/PropertyList.h"
 #include "platform/process/ProcessInfo.h"
@@ -64,11 +65,6 @@ bool isDirectory(const std::string& path) {
 bool isRegularFile(const std::string& path) {
     auto mode = fileMode(path);
     return mode && S_ISREG(*mode);
-}
-
-std::string parentOf(const std::string& absolute) {
-    auto slash = absolute.rfind('/');
-    return slash == 0 ? "/" : absolute.substr(0, slash);
 }
 
 bool isPlainFileName(std::string_view name) {
@@ -136,7 +132,7 @@ std::optional<BundleDirectory> BundleDirectory::aroundExecutable(const std::stri
     if (!mode || S_ISDIR(*mode)) {
         return std::nullopt;
     }
-    std::string folder = parentOf(*executable);
+    std::string folder = parentFolderOf(*executable);
     auto state = std::make_shared<State>();
     if (isRegularFile(joinPath(folder, kInfoFileName))) {
         state->path = folder;

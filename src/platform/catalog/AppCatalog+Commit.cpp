@@ -47,48 +47,53 @@ const CatalogApplication* AppCatalog::currentApplication(const Pass& pass, const
     return found == applications_.end() ? nullptr : &found->second.stored;
 }
 
+namespace {
+
+// What a pass staged for one kind of row: written rows, and removed paths.
+template <class Staged, class Row>
+void addStaged(const Staged& staged, std::vector<Row>& written, std::vector<std::string>& removed) {
+    for (const auto& [path, row] : staged) {
+        if (row) {
+            written.push_back(*row);
+        } else {
+            removed.push_back(path);
+        }
+    }
+}
+
+// Every row as it stands after a pass: the known ones as the pass leaves
+// them, then the ones the pass adds.
+template <class Known, class Staged, class Current, class Row>
+void addEverything(const Known& known, const Staged& staged, Current current, std::vector<Row>& written) {
+    for (const auto& entry : known) {
+        if (const Row* row = current(entry.first)) {
+            written.push_back(*row);
+        }
+    }
+    for (const auto& [path, row] : staged) {
+        if (row && !known.contains(path)) {
+            written.push_back(*row);
+        }
+    }
+}
+
+}  // namespace
+
 CatalogDatabase::Changes AppCatalog::changesOf(const Pass& pass) const {
     CatalogDatabase::Changes changes;
-    for (const auto& [path, staged] : pass.bundles) {
-        if (staged) {
-            changes.writtenBundles.push_back(*staged);
-        } else {
-            changes.removedBundles.push_back(path);
-        }
-    }
-    for (const auto& [path, staged] : pass.applications) {
-        if (staged) {
-            changes.writtenApplications.push_back(*staged);
-        } else {
-            changes.removedApplications.push_back(path);
-        }
-    }
+    addStaged(pass.bundles, changes.writtenBundles, changes.removedBundles);
+    addStaged(pass.applications, changes.writtenApplications, changes.removedApplications);
     changes.language = pass.language;
     return changes;
 }
 
 CatalogDatabase::Changes AppCatalog::everythingAfter(const Pass& pass) const {
     CatalogDatabase::Changes changes;
-    for (const auto& [path, entry] : bundles_) {
-        if (const CatalogBundle* bundle = currentBundle(pass, path)) {
-            changes.writtenBundles.push_back(*bundle);
-        }
-    }
-    for (const auto& [path, staged] : pass.bundles) {
-        if (staged && !bundles_.contains(path)) {
-            changes.writtenBundles.push_back(*staged);
-        }
-    }
-    for (const auto& [path, application] : applications_) {
-        if (const CatalogApplication* row = currentApplication(pass, path)) {
-            changes.writtenApplications.push_back(*row);
-        }
-    }
-    for (const auto& [path, staged] : pass.applications) {
-        if (staged && !applications_.contains(path)) {
-            changes.writtenApplications.push_back(*staged);
-        }
-    }
+    addEverything(bundles_, pass.bundles, [&](const std::string& path) { return currentBundle(pass, path); },
+                  changes.writtenBundles);
+    addEverything(applications_, pass.applications,
+                  [&](const std::string& path) { return currentApplication(pass, path); },
+                  changes.writtenApplications);
     changes.language = options_.language.value_or("");
     return changes;
 }

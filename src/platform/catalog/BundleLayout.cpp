@@ -101,12 +101,4 @@ bool isUnderAnyRoot(std::string_view path, const std::vector<std::string>& roots
     return std::any_of(roots.begin(), roots.end(), [path](const std::string& root) { return isPathWithin(path, root); });
 }
 
-std::string parentFolderOf(const std::string& path) {
-    auto slash = path.rfind('/');
-    if (slash == std::string::npos) {
-        return ".";
-    }
-    return slash == 0 ? "/" : path.substr(0, slash);
-}
-
 }  // namespace qm

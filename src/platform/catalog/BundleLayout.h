@@ -11,6 +11,8 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/file/PathFacts.h"
+
 namespace qm {
 
 // The directories directly inside folder (symbolic links to directories
@@ -32,7 +34,5 @@ std::optional<std::string> containingApplicationPath(const std::string& bundlePa
 // path-component boundary.
 bool isUnderAnyRoot(std::string_view path, const std::vector<std::string>& roots);
 
-// The folder holding path ("/" for "/x").
-std::string parentFolderOf(const std::string& path);
 
 }  // namespace qm

@@ -38,4 +38,12 @@ bool isPathWithin(std::string_view path, std::string_view root) {
     return path[root.size()] == '/';
 }
 
+std::string parentFolderOf(const std::string& path) {
+    auto slash = path.rfind('/');
+    if (slash == std::string::npos) {
+        return ".";
+    }
+    return slash == 0 ? "/" : path.substr(0, slash);
+}
+
 }  // namespace qm

@@ -10,6 +10,7 @@
 
 #include "platform/fd/UniqueFd.h"
 #include "platform/file/FolderEntries.h"
+#include "platform/file/WriteAll.h"
 #include "platform/log/SystemLog.h"
 #include "platform/notify/NotificationFiles.h"
 
@@ -48,20 +49,6 @@ MaybeError deleteFilesIn(const std::string& path) {
         if (::unlink(file.c_str()) != 0 && errno != ENOENT) {
             systemLogf(kLogNotice, "leaving %s in place: %s", file, std::strerror(errno));
         }
-    }
-    return std::nullopt;
-}
-
-MaybeError writeAll(int fd, std::string_view text) {
-    while (!text.empty()) {
-        ssize_t n = ::write(fd, text.data(), text.size());
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n < 0) {
-            return posixError(errno, "writing");
-        }
-        text.remove_prefix(static_cast<std::size_t>(n));
     }
     return std::nullopt;
 }

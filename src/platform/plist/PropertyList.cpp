@@ -10,6 +10,8 @@
 #include <string_view>
 
 #include "platform/fd/UniqueFd.h"
+#include "platform/file/PathFacts.h"
+#include "platform/file/WriteAll.h"
 #include "platform/plist/BinaryStructureCheck.h"
 #include "platform/plist/LibplistSupport.h"
 #include "platform/plist/PlistFromValue.h"
@@ -27,29 +29,6 @@ qm::Error withName(qm::Error error, const std::string& name) {
 
 qm::Error fileError(int code, const std::string& name, const char* what) {
     return qm::Error{kPosixErrorDomain, code, name + ": " + what};
-}
-
-std::string parentDirectory(const std::string& path) {
-    auto slash = path.rfind('/');
-    if (slash == std::string::npos) {
-        return ".";
-    }
-    return slash == 0 ? "/" : path.substr(0, slash);
-}
-
-qm::MaybeError writeAll(int fd, const qm::Bytes& bytes) {
-    std::size_t written = 0;
-    while (written < bytes.size()) {
-        ssize_t n = ::write(fd, bytes.data() + written, bytes.size() - written);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            return qm::posixError(n < 0 ? errno : EIO, "write");
-        }
-        written += static_cast<std::size_t>(n);
-    }
-    return std::nullopt;
 }
 
 }  // namespace
@@ -161,7 +140,7 @@ qm::MaybeError writeFileAtomically(const std::string& path, const qm::Value& val
     if (!bytes) {
         return withName(std::move(bytes).error(), path);
     }
-    std::string directory = parentDirectory(path);
+    std::string directory = qm::parentFolderOf(path);
     std::string base = path.substr(path.rfind('/') == std::string::npos ? 0 : path.rfind('/') + 1);
     if (base.empty()) {
         return qm::posixError(EISDIR, path);
@@ -179,7 +158,7 @@ qm::MaybeError writeFileAtomically(const std::string& path, const qm::Value& val
     if (::stat(path.c_str(), &existing) == 0 && ::fchmod(fd.get(), existing.st_mode & 07777) != 0) {
         return fail(errno, "keeping the permissions of");
     }
-    if (auto error = writeAll(fd.get(), *bytes)) {
+    if (auto error = qm::writeAll(fd.get(), *bytes)) {
         return fail(static_cast<int>(error->code), "writing");
     }
     if (::fsync(fd.get()) != 0) {

@@ -10,6 +10,8 @@
 
 #include "platform/fd/UniqueFd.h"
 #include "platform/file/Directories.h"
+#include "platform/file/PathFacts.h"
+#include "platform/file/WriteAll.h"
 
 namespace qm {
 
@@ -17,14 +19,6 @@ namespace {
 
 constexpr const char* kKeyFileName = "token.key";
 constexpr mode_t kPrivateFolderMode = 0700;
-
-std::string folderOf(const std::string& path) {
-    auto slash = path.rfind('/');
-    if (slash == std::string::npos) {
-        return ".";
-    }
-    return slash == 0 ? "/" : path.substr(0, slash);
-}
 
 struct KeyFile {
     dev_t device = 0;
@@ -67,16 +61,8 @@ MaybeError writePrivately(int fd, const TokenKeyBytes& bytes, const std::string&
     if (::fchmod(fd, 0600) != 0) {
         return posixError(errno, "token key " + path);
     }
-    std::size_t done = 0;
-    while (done < bytes.size()) {
-        ssize_t n = ::write(fd, bytes.data() + done, bytes.size() - done);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            return posixError(n < 0 ? errno : EIO, "writing " + path);
-        }
-        done += static_cast<std::size_t>(n);
+    if (auto error = writeAll(fd, bytes)) {
+        return posixError(static_cast<int>(error->code), "writing " + path);
     }
     if (::fsync(fd) != 0) {
         return posixError(errno, "flushing " + path);
@@ -92,7 +78,7 @@ Result<KeyFile> createKeyFile(const std::string& path) {
     if (::RAND_bytes(key.bytes.data(), static_cast<int>(key.bytes.size())) != 1) {
         return posixError(EIO, "no random bytes for the token key");
     }
-    std::string folder = folderOf(path);
+    std::string folder = parentFolderOf(path);
     if (auto failed = createDirectories(folder, kPrivateFolderMode)) {
         return *failed;
     }
