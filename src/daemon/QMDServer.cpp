@@ -37,6 +37,11 @@ qm::Result<QMDServer*> QMDServer::initForService(const std::string& serviceName,
         return listener.error();
     }
     server->service_ = std::move(listener).value();
+    // Counts restart with the daemon (a failure was logged by the poster),
+    // before the registry starts and may post; registrations of hosts that
+    // exited meanwhile go.
+    (void)server->notifications_.reset();
+    qm::removeExitedHostRegistrations(qm::ductRuntimeDirectory());
     QMDServer* raw = server.get();
     server->service_->setConnectionHandler([raw](std::shared_ptr<qm::duct::PeerConnection> connection) {
         // The client keeps itself alive through its connection.
@@ -66,14 +71,11 @@ QMDServer::QMDServer(std::unique_ptr<qm::EventLoop> loop, std::unique_ptr<QMData
       notifications_(qm::ductRuntimeDirectory()),
       holds_([this] { (void)notifications_.post(wire::kAnnotationChangeNotification); }) {
     registry_->setAnnotationsChanged([this] { (void)notifications_.post(wire::kAnnotationChangeNotification); });
+    registry_->setPlugInsChanged([this] { (void)notifications_.post(wire::kPlugInsChangeNotification); });
     registry_->setDelegate([this](const std::vector<qm::PlugInRecordPtr>& records) { removedPlugIns(records); });
 }
 
 void QMDServer::run() {
-    // Counts restart with the daemon (a failure was logged by the poster);
-    // registrations of hosts that exited meanwhile go.
-    (void)notifications_.reset();
-    qm::removeExitedHostRegistrations(qm::ductRuntimeDirectory());
     registry_->whenReady([this] { loop_->post([this] { resumeListener(); }); });
     loop_->run();
 }

@@ -5,6 +5,7 @@
 #include "discovery/MatchRequest.h"
 #include "registry/AnnotateRequest.h"
 #include "registry/HoldsRequest.h"
+#include "registry/ListRequest.h"
 #include "registry/RegistrationRequests.h"
 
 namespace {
@@ -21,6 +22,7 @@ constexpr Route kRoutes[] = {
     {"lock", &lockDownPlugIns, false},
     // Beyond the design: answered only to clients that are not sandboxed.
     {"holds", &listHolds, false},
+    {"list", &listPlugIns, false},
 };
 
 }  // namespace

@@ -30,5 +30,7 @@ inline constexpr const char* kDefaultServiceName = "ovaro.quamber.qmd";
 
 // Posted after every change of annotations and every hold taken or released.
 inline constexpr const char* kAnnotationChangeNotification = "ovaro.quamber.annotation-change";
+// Posted once the daemon has taken in plug-ins installed or uninstalled.
+inline constexpr const char* kPlugInsChangeNotification = "ovaro.quamber.plugins-change";
 
 }  // namespace wire

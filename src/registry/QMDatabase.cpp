@@ -310,6 +310,59 @@ QMDatabase::Candidates QMDatabase::findCandidates(const qm::Dictionary* rules, b
     return candidates;
 }
 
+// ---- listing
+
+QMDatabase::PlugInListing QMDatabase::listPlugIns(const std::optional<std::string>& point, std::size_t offset,
+                                                  std::size_t limit) {
+    auto index = catalog_->index();
+    std::vector<qm::PlugInRecordPtr> records = point ? index->plugInsForExtensionPoints({*point}, {}) : index->all();
+    std::vector<qm::CatalogRefusal> refusals;
+    if (!point) {
+        refusals = *catalog_->refusals();
+    }
+    // Both lists are in path order; a refused bundle is never registered.
+    std::vector<ListedPlugIn> merged;
+    merged.reserve(records.size() + refusals.size());
+    auto refusal = refusals.begin();
+    for (const auto& record : records) {
+        for (; refusal != refusals.end() && refusal->path < record->bundlePath; ++refusal) {
+            merged.push_back({nullptr, refusal->path, refusal->reason, std::nullopt});
+        }
+        merged.push_back({record, record->bundlePath, std::nullopt, std::nullopt});
+    }
+    for (; refusal != refusals.end(); ++refusal) {
+        merged.push_back({nullptr, refusal->path, refusal->reason, std::nullopt});
+    }
+
+    PlugInListing listing;
+    listing.total = merged.size();
+    const std::size_t first = std::min(offset, merged.size());
+    const std::size_t last = first + std::min(limit, merged.size() - first);
+    listing.page.assign(std::make_move_iterator(merged.begin() + static_cast<std::ptrdiff_t>(first)),
+                        std::make_move_iterator(merged.begin() + static_cast<std::ptrdiff_t>(last)));
+    sync_.sync([&] {
+        for (ListedPlugIn& listed : listing.page) {
+            if (!listed.record) {
+                continue;
+            }
+            const qm::PlugInRecord& record = *listed.record;
+            if (!cache_.contains(record.uuid)) {
+                auto built = QMDPlugIn::build(listed.record);
+                if (!built) {
+                    listed.invalidReason =
+                        built.error().reason.empty() ? std::string("incomplete catalog record") : built.error().reason;
+                }
+            }
+            auto annotation = annotations_->annotationForIdentifier(
+                QMDPlugIn::annotationKeyOf(record.identifier, record.entitlements));
+            if (const qm::Value* election = annotation ? annotation->get("election") : nullptr) {
+                listed.election = *election;
+            }
+        }
+    });
+    return listing;
+}
+
 // ---- registration
 
 qm::MaybeError QMDatabase::addPlugIn(const std::string& path) {
@@ -352,6 +405,9 @@ void QMDatabase::pluginsDidInstall(const std::vector<qm::PlugInRecordPtr>& recor
         qm::systemLogf(qm::kLogNotice, "INSTALLED:%@ %@(%@) %@ %@", record->bundleIdentifier, record->identifier,
                        record->bundleVersion, record->uuid.text(), record->bundlePath);
     }
+    if (plugInsChanged_) {
+        plugInsChanged_();
+    }
 }
 
 void QMDatabase::pluginsWillUninstall(const std::vector<qm::PlugInRecordPtr>& records) {
@@ -367,6 +423,9 @@ void QMDatabase::pluginsWillUninstall(const std::vector<qm::PlugInRecordPtr>& re
         }
         if (removedPlugIns_) {
             removedPlugIns_(records);
+        }
+        if (plugInsChanged_) {
+            plugInsChanged_();
         }
     });
 }

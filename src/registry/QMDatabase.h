@@ -40,6 +40,9 @@ public:
     using RemovedPlugIns = std::function<void(const std::vector<qm::PlugInRecordPtr>&)>;
     // Posts "ovaro.quamber.annotation-change".
     using AnnotationsChanged = std::function<void()>;
+    // Posts "ovaro.quamber.plugins-change": plug-ins were installed or
+    // uninstalled and the registry has caught up with it.
+    using PlugInsChanged = std::function<void()>;
 
     // Opens the annotation store (`databasePath`, else its default file) and
     // observes the catalog. Fails when the store's default folder cannot be
@@ -53,6 +56,7 @@ public:
     // Both set before the server serves.
     void setDelegate(RemovedPlugIns removedPlugIns) { removedPlugIns_ = std::move(removedPlugIns); }
     void setAnnotationsChanged(AnnotationsChanged changed) { annotationsChanged_ = std::move(changed); }
+    void setPlugInsChanged(PlugInsChanged changed) { plugInsChanged_ = std::move(changed); }
 
     // Starts the catalog's first scan of the install roots. Once.
     void start();
@@ -86,6 +90,24 @@ public:
 
     QMDPlugInPtr plugInForProxy(const qm::PlugInRecordPtr& record);
 
+    // What a developer asks: every registered plug-in (of one extension point
+    // when given), each judged valid or not, and, without a point, the
+    // bundles the catalog refused, merged in path order. A plug-in not built
+    // yet is judged by a build that is thrown away (no cache entry, no
+    // auto-election, no log line), so listing changes nothing. Only the
+    // page asked for is judged.
+    struct ListedPlugIn {
+        qm::PlugInRecordPtr record;  // null for a refused bundle
+        std::string path;
+        std::optional<std::string> invalidReason;
+        std::optional<qm::Value> election;
+    };
+    struct PlugInListing {
+        std::vector<ListedPlugIn> page;
+        std::size_t total = 0;
+    };
+    PlugInListing listPlugIns(const std::optional<std::string>& point, std::size_t offset, std::size_t limit);
+
     // --- catalog registration -----------------------------------------
     // The catalog's error (domain "AppCatalog") when it refuses.
     qm::MaybeError addPlugIn(const std::string& path);
@@ -116,6 +138,7 @@ private:
     std::shared_ptr<CatalogObserver> observer_;
     RemovedPlugIns removedPlugIns_;
     AnnotationsChanged annotationsChanged_;
+    PlugInsChanged plugInsChanged_;
     // Registry queue only.
     std::unordered_map<qm::Uuid, QMDPlugInPtr, qm::UuidHash> cache_;
 

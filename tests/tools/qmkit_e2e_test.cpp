@@ -7,12 +7,14 @@
 #include <cstring>
 #include <filesystem>
 #include <functional>
+#include <sstream>
 #include <thread>
 #include <tuple>
 
 #include "model/ModelTestSupport.h"
 #include "platform/value/Json.h"
 #include "support/DaemonProcess.h"
+#include "support/Eventually.h"
 #include "support/FramePeer.h"
 
 using modeltest::at;
@@ -382,6 +384,138 @@ TEST_F(Qmkit, AccessGrantsTokensThatVerifyAndReadyShowsTheRegistration) {
     const std::string file = *registration.get("file")->asString();
     EXPECT_TRUE(startsWith(file, daemon_.runtimeDirectory() + "/services/")) << file;
     EXPECT_NE(qmtest::readFile(file).find("ovaro.example.notes.share"), std::string::npos) << file;
+}
+
+// "list" shows every plug-in with its verdict and the bundles the catalog
+// refused; "watch" prints each change made while it runs, changes made
+// together included, in both of its formats.
+TEST_F(Qmkit, ListShowsVerdictsAndWatchPrintsEveryChange) {
+    const std::string studio = fs::canonical(roots_.file("system")).string() + "/Studio.app/Contents/PlugIns/";
+    ProgramResult listed = qmkit({"list"});
+    EXPECT_EQ(listed.exitStatus, 0) << listed.err;
+    EXPECT_NE(listed.out.find("-\t-\t-\t-\t" + studio + "Broken.bundle\tinvalid: unreadable Info.plist\n"),
+              std::string::npos) << listed.out;
+    EXPECT_NE(listed.out.find("\tovaro.example.studio.hybrid\t"), std::string::npos);
+    EXPECT_NE(listed.out.find("Hybrid.bundle\tinvalid: hybrid plug-ins are not supported"), std::string::npos);
+    ProgramResult widgets = qmkit({"list", "--point", "ovaro.widget"});
+    EXPECT_EQ(std::count(widgets.out.begin(), widgets.out.end(), '\n'), 2) << widgets.out;
+    EXPECT_NE(widgets.out.find("\tovaro.example.notes.widget\t1.0\tovaro.widget\t"), std::string::npos);
+    EXPECT_NE(widgets.out.find("Inspector.xbun\tinvalid: Application Extensions may not use the \"PrincipalClass\" key"),
+              std::string::npos);
+
+    // Studio leaves before the watchers start and comes back while they run.
+    const std::string parked = roots_.file("Studio.app");
+    fs::rename(roots_.file("system/Studio.app"), parked);
+    ASSERT_TRUE(qmtest::eventually([&] { return qmkit({"list"}).out.find("Studio.app") == std::string::npos; }));
+
+    // Stopped by SIGTERM, which it answers with exit status 0.
+    struct Watcher {
+        std::string output;
+        ProgramResult result;
+        std::thread thread;
+        void stop() {
+            if (thread.joinable()) {
+                ::kill(std::stoi(qmtest::readFile(output + ".pid")), SIGTERM);
+                thread.join();
+            }
+        }
+        ~Watcher() { stop(); }
+    };
+    Watcher text, json;
+    text.output = roots_.file("watch.txt");
+    json.output = roots_.file("watch.json");
+    for (Watcher* watcher : {&text, &json}) {
+        std::vector<std::string> args{"/bin/sh", "-c", "echo $$ > \"$0.pid\"; exec \"$@\" > \"$0\"", watcher->output,
+                                      QMKIT_BINARY_PATH, "-S", daemon_.serviceName(), "watch"};
+        if (watcher == &json) {
+            args.insert(args.end() - 1, "--json");
+        }
+        watcher->thread = std::thread([this, watcher, args] {
+            watcher->result = runProgram(args, {{"QM_DUCT_DIR", daemon_.runtimeDirectory()}, {"QM_LOG_STDERR", "0"}});
+        });
+    }
+    // Elections until both report one: then both have made their first look.
+    const std::string share = uuidOf("ovaro.example.notes.share");
+    const std::string spelling = uuidOf("ovaro.example.notes.spelling");
+    auto elect = [&](const std::vector<std::string>& uuids, int election) {
+        std::string list;
+        for (const std::string& uuid : uuids) {
+            list += (list.empty() ? "" : ", ") + std::string("{\"$uuid\": \"") + uuid + "\"}";
+        }
+        ProgramResult annotated = qmkit({"send", R"({"request": "annotate", "uuids": [)" + list +
+                                                     R"(], "annotations": {"election": )" + std::to_string(election) + "}}"});
+        EXPECT_EQ(annotated.exitStatus, 0) << annotated.err;
+    };
+    int warmUp = 10;
+    ASSERT_TRUE(qmtest::eventually([&] {
+        elect({share}, ++warmUp);
+        std::this_thread::sleep_for(50ms);
+        return qmtest::readFile(text.output).find(" election ") != std::string::npos &&
+               qmtest::readFile(json.output).find("\"election\"") != std::string::npos;
+    }));
+    const std::size_t textStart = qmtest::readFile(text.output).size();
+    const std::size_t jsonStart = qmtest::readFile(json.output).size();
+
+    fs::rename(parked, roots_.file("system/Studio.app"));  // seven plug-ins at once
+    ASSERT_TRUE(qmtest::eventually([&] { return qmkit({"list"}).out.find("Studio.app") != std::string::npos; }));
+    elect({share, spelling}, 1);                           // two elections at once
+    ProgramResult held;
+    std::thread holder([&] { held = qmkit({"hold", roots_.file("system/Notes.app")}); });
+    const qm::Array holds = holdsWhen([](const qm::Array& now) { return now.size() == 1; });
+    ASSERT_EQ(holds.size(), 1u);
+    const std::string token = *holds[0].get("uuid")->asString();
+    EXPECT_EQ(qmkit({"release", token}).exitStatus, 0);
+    holder.join();
+    fs::remove_all(roots_.file("system/Studio.app"));
+
+    auto events = [&](const std::string& output, std::size_t start) {
+        std::vector<qm::Value> parsed;
+        std::istringstream lines(qmtest::readFile(output).substr(start));
+        for (std::string line; std::getline(lines, line);) {
+            auto value = qm::json::parse(line);
+            EXPECT_TRUE(value.ok()) << line;
+            parsed.push_back(value.ok() ? *value : Value());
+        }
+        return parsed;
+    };
+    const std::size_t expected = 7 + 2 + 2 + 7;
+    ASSERT_TRUE(qmtest::eventually([&] { return events(json.output, jsonStart).size() >= expected; }))
+        << qmtest::readFile(json.output);
+    std::map<std::string, int> counts;
+    for (const Value& event : events(json.output, jsonStart)) {
+        const std::string name = *event.get("event")->asString();
+        ++counts[name];
+        EXPECT_TRUE(event.get("time") && event.get("time")->asString()) << event.description();
+        if (name == "election") {
+            EXPECT_EQ(*event.get("election"), Value(1));
+        } else if (name == "held" || name == "released") {
+            EXPECT_EQ(*event.get("token"), Value(token));
+            EXPECT_EQ(event.get("plugins")->asArray()->size(), 4u);
+        } else {
+            EXPECT_EQ(event.get("path")->asString()->rfind(studio, 0), 0u) << event.description();
+        }
+    }
+    EXPECT_EQ(counts, (std::map<std::string, int>{{"installed", 7}, {"election", 2}, {"held", 1}, {"released", 1},
+                                                   {"uninstalled", 7}}));
+
+    for (Watcher* watcher : {&text, &json}) {
+        watcher->stop();
+        EXPECT_EQ(watcher->result.exitStatus, 0) << watcher->result.err;
+    }
+    std::istringstream lines(qmtest::readFile(text.output).substr(textStart));
+    std::vector<std::string> textEvents;
+    for (std::string time, event, rest; lines >> time >> event && std::getline(lines, rest);) {
+        EXPECT_EQ(time.size(), std::string("2026-11-23T19:04:05.123+00:00").size()) << time;
+        textEvents.push_back(event);
+    }
+    std::vector<std::string> jsonEvents;
+    for (const Value& event : events(json.output, jsonStart)) {
+        jsonEvents.push_back(*event.get("event")->asString());
+    }
+    // Each watcher splits the changes between its looks as they fall.
+    std::sort(textEvents.begin(), textEvents.end());
+    std::sort(jsonEvents.begin(), jsonEvents.end());
+    EXPECT_EQ(textEvents, jsonEvents);
 }
 
 }  // namespace

@@ -7,24 +7,24 @@
 // which the daemon posts for every hold taken or released; the connection
 // lost (exit 3).
 
-#include <sys/epoll.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <functional>
+#include <set>
 #include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "ChangeWatch.h"
 #include "Command.h"
 #include "DaemonSession.h"
 #include "NumberOptions.h"
 #include "ReplyFormat.h"
 #include "platform/env/Environment.h"
-#include "platform/notify/NotificationWatcher.h"
 #include "platform/process/TerminationSignals.h"
 #include "platform/queue/EventLoop.h"
 #include "protocol/WireKeys.h"
@@ -101,16 +101,6 @@ void printError(const std::string& message) {
     std::fprintf(stderr, "qmkit: hold: %s\n", message.c_str());
 }
 
-// Calls a function whenever its descriptor is readable, on the loop thread.
-class ReadableSource final : public qm::EventSource {
-public:
-    explicit ReadableSource(std::function<void()> onReadable) : onReadable_(std::move(onReadable)) {}
-    void handleEvents(std::uint32_t /*events*/) override { onReadable_(); }
-
-private:
-    std::function<void()> onReadable_;
-};
-
 // Whether the daemon still lists the hold; an exit status when it cannot tell.
 qm::Result<bool, int> isListed(DaemonSession& session, const qm::Uuid& token) {
     auto reply = session.ask([](QMDaemonClient& client, QMDaemonClient::ReplyHandler handler) {
@@ -133,63 +123,16 @@ qm::Result<bool, int> isListed(DaemonSession& session, const qm::Uuid& token) {
 // Runs the loop until the hold ends; the exit status. The loop must outlive
 // the session's client, whose connection events post to it.
 int waitForTheEnd(DaemonSession& session, const qm::Uuid& token, qm::EventLoop& loop) {
-    std::optional<int> status;
-    auto finish = [&](int exitStatus) {
-        if (!status) {
-            status = exitStatus;
-            loop.stop();
+    return followChanges(session, loop, "hold", [&](const std::set<std::string>& changed) -> std::optional<int> {
+        if (!changed.empty() && !changed.contains(kHoldsChanged)) {
+            return std::nullopt;
         }
-    };
-    auto checkListed = [&] {
         auto listed = isListed(session, token);
         if (!listed) {
-            finish(listed.error());
-        } else if (!*listed) {
-            finish(kQmkitOk);
+            return listed.error();
         }
-    };
-    // Watching starts before the first look, so no release goes unseen.
-    auto watcher = qm::NotificationWatcher::open(qm::ductRuntimeDirectory());
-    if (!watcher) {
-        printError("cannot watch for releases: " + watcher.error().text());
-        return kQmkitUnreachable;
-    }
-    auto posts = std::make_shared<ReadableSource>([&] {
-        bool changed = false;
-        auto noteChange = [&](const std::string& name, std::uint64_t) { changed = changed || name == kHoldsChanged; };
-        // Until nothing is left, so that the end of the watch is noticed too.
-        for (;;) {
-            auto calls = watcher->waitForPosts(std::chrono::milliseconds(0), noteChange);
-            if (!calls) {
-                printError("cannot watch for releases: " + calls.error().text());
-                finish(kQmkitUnreachable);
-                return;
-            }
-            if (*calls == 0) {
-                break;
-            }
-        }
-        if (changed && !status) {
-            checkListed();
-        }
+        return *listed ? std::nullopt : std::optional<int>(kQmkitOk);
     });
-    auto signals = qm::TerminationSignals::watch(loop, [&](const char*) { finish(kQmkitOk); });
-    auto watching = loop.add(watcher->descriptor(), EPOLLIN, posts);
-    if (!signals || !watching) {
-        printError("cannot wait: " + (signals ? watching.error() : signals.error()).text());
-        return kQmkitUnreachable;
-    }
-    session.client()->setInvalidationHandler([&loop, &finish](const qm::Error& reason) {
-        loop.post([&finish, reason] {
-            std::fprintf(stderr, "qmkit: %s\n", reason.text().c_str());
-            finish(kQmkitUnreachable);
-        });
-    });
-    checkListed();
-    if (!status) {
-        loop.run();
-    }
-    return *status;
 }
 
 int run(const std::vector<std::string>& args, const QmkitGlobalOptions& options) {

@@ -102,7 +102,7 @@ MaybeError AppCatalog::commit(Pass& pass) {
     queue_.assertCurrent();
     settleApplications(pass);
     if (pass.bundles.empty() && pass.applications.empty() && !pass.language) {
-        if (pass.applicationsMoved) {
+        if (pass.applicationsMoved || refusalsChanged_) {
             publish();
         }
         return std::nullopt;
@@ -206,8 +206,26 @@ void AppCatalog::publish() {
         applications.push_back({path, application.stored.localizedName});
     }
     auto index = std::make_shared<const CatalogIndex>(std::move(records), applications);
+    auto refusals = std::make_shared<std::vector<CatalogRefusal>>();
+    for (const auto& [path, refusal] : refused_) {
+        refusals->push_back({path, refusal.reason});
+    }
+    refusalsChanged_ = false;
     std::lock_guard lock(indexMutex_);
     index_ = std::move(index);
+    refusals_ = std::move(refusals);
+}
+
+void AppCatalog::refuse(const std::string& path, Refusal refusal) {
+    auto found = refused_.find(path);
+    if (found == refused_.end() || found->second.reason != refusal.reason) {
+        refusalsChanged_ = true;
+    }
+    refused_.insert_or_assign(path, std::move(refusal));
+}
+
+void AppCatalog::forgetRefusal(const std::string& path) {
+    refusalsChanged_ = refused_.erase(path) > 0 || refusalsChanged_;
 }
 
 void AppCatalog::notify(const std::vector<PlugInRecordPtr>& removed, const std::vector<PlugInRecordPtr>& installed) {

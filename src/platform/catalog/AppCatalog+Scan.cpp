@@ -330,9 +330,15 @@ void AppCatalog::recheckFolder(Pass& pass, const std::string& folder) {
             ++pending;
         }
     }
-    std::erase_if(refused_, [&](const auto& refusal) {
-        return parentFolderOf(refusal.first) == folder && !present.contains(refusal.first);
-    });
+    std::vector<std::string> gone;
+    for (const auto& [path, refusal] : refused_) {
+        if (parentFolderOf(path) == folder && !present.contains(path)) {
+            gone.push_back(path);
+        }
+    }
+    for (const auto& path : gone) {
+        forgetRefusal(path);
+    }
     for (const auto& path : present) {
         examine(pass, path, folder, false, nullptr);
     }
@@ -390,14 +396,14 @@ BundleReadOutcome AppCatalog::examine(Pass& pass, const std::string& path, const
             read.entry->source = newSource;
             read.entry->added = newAdded;
             pass.bundles[path] = std::move(read.entry);
-            refused_.erase(path);
+            forgetRefusal(path);
             watchPending(path, source, false);
             return BundleReadOutcome::plugIn;
         }
         if (existing) {
             pass.bundles[path] = std::nullopt;  // it was a plug-in; it is no longer
         }
-        refused_[path] = {keys.info, read.outcome, read.reason};
+        refuse(path, {keys.info, read.outcome, read.reason});
     }
     // A bundle still being written is watched until its Info parses.
     if (read.outcome != BundleReadOutcome::unreadable) {

@@ -126,6 +126,11 @@ std::shared_ptr<const CatalogIndex> AppCatalog::index() const {
     return index_;
 }
 
+CatalogRefusals AppCatalog::refusals() const {
+    std::lock_guard lock(indexMutex_);
+    return refusals_ ? refusals_ : std::make_shared<const std::vector<CatalogRefusal>>();
+}
+
 PlugInRecordPtr AppCatalog::plugInWithUuid(const Uuid& uuid) const {
     return index()->plugInWithUuid(uuid);
 }

@@ -119,6 +119,8 @@ public:
                                                            const PlugInFilter& filter = {}) const;
     // The whole current index, for several lookups on one state.
     std::shared_ptr<const CatalogIndex> index() const;
+    // The bundles read and not registered, in path order, as last published.
+    CatalogRefusals refusals() const;
 
     // How many Info files the catalog has parsed since it was opened (tests
     // use it to see that unchanged bundles are not read again).
@@ -177,6 +179,9 @@ private:
     Entry makeEntry(CatalogBundle stored) const;
     PlugInRecordPtr makeRecord(const CatalogBundle& bundle, const CatalogPlugIn& plugIn) const;
     void publish();
+    // refused_ changes through these, so the next commit publishes them.
+    void refuse(const std::string& path, Refusal refusal);
+    void forgetRefusal(const std::string& path);
     void notify(const std::vector<PlugInRecordPtr>& removed, const std::vector<PlugInRecordPtr>& installed);
     std::string lookupPath(const std::string& path) const;
 
@@ -191,6 +196,7 @@ private:
     std::map<std::string, std::string> folderOwner_;     // plug-ins folder -> its application
     std::map<std::string, std::string> pendingBundles_;  // bundle -> its plug-ins folder, until its Info parses
     std::map<std::string, Refusal> refused_;             // bundles read and not registered
+    bool refusalsChanged_ = false;                       // since the last publish
     std::unique_ptr<FolderWatcher> watcher_;
     CatalogWatches watches_;
 
@@ -198,6 +204,7 @@ private:
 
     mutable std::mutex indexMutex_;
     std::shared_ptr<const CatalogIndex> index_;
+    CatalogRefusals refusals_;
 
     std::mutex observersMutex_;
     std::vector<std::weak_ptr<AppCatalogObserver>> observers_;

@@ -59,6 +59,14 @@ struct ApplicationRecord {
 };
 using ApplicationRecordPtr = std::shared_ptr<const ApplicationRecord>;
 
+// A bundle in a plug-ins folder (or given to registerPlugIn) that the
+// catalog read and did not register, with why.
+struct CatalogRefusal {
+    std::string path;
+    std::string reason;
+};
+using CatalogRefusals = std::shared_ptr<const std::vector<CatalogRefusal>>;
+
 // Told of every change of the set of registered plug-ins, on the catalog's
 // own thread, one call at a time, after the change is committed and
 // published: lookups already answer for the installed records and no longer
