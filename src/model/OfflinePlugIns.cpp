@@ -1,6 +1,10 @@
 #include "model/OfflinePlugIns.h"
 
+#include <sys/stat.h>
+
 #include <algorithm>
+#include <cerrno>
+#include <cstring>
 #include <limits>
 #include <utility>
 
@@ -33,8 +37,41 @@ DeclaredTop declaredTop(const qm::Value& info) {
     return {};
 }
 
-bool declaresMultiple(const qm::Value& info) {
-    return declaredTop(info).top.get(qmkey::kMultiple) != nullptr;
+qm::Error notAPlugInBundle(const std::string& path, const std::string& why) {
+    return QMErrorWithFormat(kQMErrorPath, "no plug-in bundle at %@: %@", path, why);
+}
+
+qm::Error applicationError(const std::string& path) {
+    std::string plugIns;
+    for (const std::string& folder : qm::plugInsFoldersOf(path)) {
+        for (const std::string& plugIn : qm::subdirectoriesOf(folder)) {
+            plugIns += (plugIns.empty() ? "" : ", ") + plugIn;
+        }
+    }
+    return QMErrorWithFormat(kQMErrorPath, "%@ is an application, not a plug-in bundle; its plug-ins: %@", path,
+                             plugIns.empty() ? std::string("none") : plugIns);
+}
+
+// The bundle directory at path, or which of the ways a path is no bundle.
+qm::Result<qm::BundleDirectory> bundleAt(const std::string& path) {
+    struct stat facts {};
+    if (::stat(path.c_str(), &facts) != 0) {
+        return notAPlugInBundle(path, errno == ENOENT ? "no such path" : std::strerror(errno));
+    }
+    if (!S_ISDIR(facts.st_mode)) {
+        return notAPlugInBundle(path, "not a directory");
+    }
+    auto resolved = qm::resolvedPath(path);
+    if (!resolved.ok()) {
+        return notAPlugInBundle(path, resolved.error().text());
+    }
+    if (auto bundle = qm::BundleDirectory::atPath(*resolved)) {
+        return *bundle;
+    }
+    if (qm::looksLikeApplication(*resolved)) {
+        return applicationError(*resolved);
+    }
+    return notAPlugInBundle(path, "no Info.plist (neither Info.plist nor Contents/Info.plist)");
 }
 
 std::optional<std::string> localizedNameOf(const qm::Value& info) {
@@ -60,13 +97,9 @@ OfflinePlugIns::OfflinePlugIns(SdkRegistry registry) : registry_(std::move(regis
 
 qm::Result<std::vector<OfflinePlugIn>> OfflinePlugIns::inspectBundle(
     const std::string& bundlePath, const std::optional<std::string>& identifier) const {
-    auto resolved = qm::resolvedPath(bundlePath);
-    std::optional<qm::BundleDirectory> bundle;
-    if (resolved.ok()) {
-        bundle = qm::BundleDirectory::atPath(*resolved);
-    }
+    auto bundle = bundleAt(bundlePath);
     if (!bundle) {
-        return QMErrorWithFormat(kQMErrorPath, "no plug-in bundle at %@", bundlePath);
+        return bundle.error();
     }
     const std::string& path = bundle->path();
     auto info = bundle->infoDictionary();
@@ -77,14 +110,25 @@ qm::Result<std::vector<OfflinePlugIn>> OfflinePlugIns::inspectBundle(
         return QMErrorWithFormat(kQMErrorPlugInUnusable, "unreadable Info dictionary in plug-in bundle at %@: %@", path,
                                  reason);
     }
+    if (declaredTop(*info).top.isNull()) {
+        if (qm::looksLikeApplication(path)) {
+            return applicationError(path);
+        }
+        return QMErrorWithFormat(kQMErrorPlugInUnusable,
+                                 "the bundle at %@ declares no plug-in: its Info dictionary has neither \"%@\" nor \"%@\"",
+                                 path, qmkey::kTop, qmkey::kOldTop);
+    }
 
     std::vector<std::optional<std::string>> identifiers;
     const std::vector<std::string> declared = declaredIdentifiers(*info);
     if (identifier) {
-        // A multiplexed bundle is asked for the named entry, so a missing one
-        // fails setup as it would in the daemon.
-        if (!declaresMultiple(*info) && std::find(declared.begin(), declared.end(), *identifier) == declared.end()) {
-            return QMErrorWithFormat(kQMErrorPlugInUnusable, "no plug-in %@ in the bundle at %@", *identifier, path);
+        if (std::find(declared.begin(), declared.end(), *identifier) == declared.end()) {
+            std::string known;
+            for (const std::string& name : declared) {
+                known += (known.empty() ? "" : ", ") + name;
+            }
+            return QMErrorWithFormat(kQMErrorPlugInUnusable, "no plug-in %@ in the bundle at %@; it has %@", *identifier,
+                                     path, known.empty() ? std::string("none") : known);
         }
         identifiers.emplace_back(*identifier);
     } else {
@@ -120,6 +164,11 @@ qm::Result<std::vector<OfflinePlugIn>> OfflinePlugIns::inspectBundle(
         }
         plugIn->setLastModified(modified.ok() ? clampedSeconds(*modified) : 0);
         plugIn->setOnSystemVolume(systemVolume);
+        inspected.infoBeforeSdk = plugIn->bundleInfoDictionary();
+        if (const std::string* sdkName = plugIn->sdkSpec().asString()) {
+            inspected.sdkName = *sdkName;
+            inspected.sdk = registry_.locate(*sdkName);
+        }
         plugIn->resolveSDK(registry_);
         plugIn->setHubProtocolVersion(hubProtocolVersionOf(*plugIn));
         plugIn->setContainingUrl(containingPath);

@@ -26,6 +26,13 @@ struct OfflinePlugIn {
     // Where the catalog keeps the plug-in's data container; none for a data
     // plug-in and for a bundle that names no executable.
     std::optional<std::string> dataContainerPath;
+    // The bundle's Info dictionary as set up, before the SDK's defaults and
+    // the canonical values (null when setup failed).
+    qm::Value infoBeforeSdk;
+    // The SDK the plug-in names and where it was looked for; none when it
+    // names none.
+    std::optional<std::string> sdkName;
+    SdkLookup sdk;
 };
 
 class OfflinePlugIns {
@@ -33,10 +40,11 @@ public:
     explicit OfflinePlugIns(SdkRegistry registry = SdkRegistry());
 
     // The plug-ins of the bundle at bundlePath: the one named identifier, or
-    // every plug-in the bundle declares when identifier is none. Fails (code
-    // 9) when there is no bundle there, or (code 12) when its Info dictionary
-    // is missing or unreadable, or identifier names no plug-in of a bundle
-    // that holds only one.
+    // every plug-in the bundle declares when identifier is none. Fails, saying
+    // which, when the path is no plug-in bundle (code 9: no such path, not a
+    // directory, no Info.plist, an application) or its Info dictionary is
+    // unreadable or declares no plug-in (code 12), and when identifier names
+    // none of the bundle's plug-ins (code 12, listing them).
     qm::Result<std::vector<OfflinePlugIn>> inspectBundle(const std::string& bundlePath,
                                                          const std::optional<std::string>& identifier) const;
 

@@ -30,23 +30,36 @@ std::optional<qm::Dictionary> readDictionaryFile(const std::string& path) {
 
 SdkRegistry::SdkRegistry(std::vector<std::string> extraDirectories) : extraDirectories_(std::move(extraDirectories)) {}
 
-std::optional<qm::Dictionary> SdkRegistry::readSDKDictionary(std::string_view name) const {
-    if (isSafeFileName(name)) {
-        if (auto testDirectory = qm::testSdkDirectory()) {
-            if (auto sdk = readDictionaryFile(*testDirectory + "/" + std::string(name))) {
-                return sdk;
-            }
-        }
-        std::vector<std::string> directories = extraDirectories_;
-        for (std::string& directory : qm::sdkSearchPath()) {
-            directories.push_back(std::move(directory));
-        }
-        for (const std::string& directory : directories) {
-            if (auto sdk = readDictionaryFile(directory + "/" + std::string(name) + ".plist")) {
-                return sdk;
-            }
+SdkLookup SdkRegistry::locate(std::string_view name) const {
+    SdkLookup lookup;
+    if (!isSafeFileName(name)) {
+        return lookup;
+    }
+    std::vector<std::string> files;
+    if (auto testDirectory = qm::testSdkDirectory()) {
+        files.push_back(*testDirectory + "/" + std::string(name));
+    }
+    for (const std::string& directory : extraDirectories_) {
+        files.push_back(directory + "/" + std::string(name) + ".plist");
+    }
+    for (const std::string& directory : qm::sdkSearchPath()) {
+        files.push_back(directory + "/" + std::string(name) + ".plist");
+    }
+    for (std::string& file : files) {
+        lookup.placesLooked.push_back(file);
+        if (auto sdk = readDictionaryFile(file)) {
+            lookup.file = std::move(file);
+            lookup.dictionary = std::move(sdk);
+            break;
         }
     }
-    qm::systemLogf(qm::kLogNotice, "plug-in sdk \"%@\" not registered", name);
-    return std::nullopt;
+    return lookup;
+}
+
+std::optional<qm::Dictionary> SdkRegistry::readSDKDictionary(std::string_view name) const {
+    SdkLookup lookup = locate(name);
+    if (!lookup.dictionary) {
+        qm::systemLogf(qm::kLogNotice, "plug-in sdk \"%@\" not registered", name);
+    }
+    return std::move(lookup.dictionary);
 }

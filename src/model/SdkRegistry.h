@@ -13,6 +13,13 @@
 
 #include "platform/value/Value.h"
 
+// Where one SDK was looked for and found.
+struct SdkLookup {
+    std::vector<std::string> placesLooked;  // every file tried, in order
+    std::optional<std::string> file;        // the one that held it (the last place looked)
+    std::optional<qm::Dictionary> dictionary;
+};
+
 class SdkRegistry {
 public:
     // extraDirectories are searched, in order, before the platform's SDK
@@ -24,6 +31,8 @@ public:
     // leave an SDK directory ("", ".", "..", anything holding "/" or NUL) is
     // never registered.
     std::optional<qm::Dictionary> readSDKDictionary(std::string_view name) const;
+    // The same lookup, told in full and never logged (qmkit inspect).
+    SdkLookup locate(std::string_view name) const;
 
     const std::vector<std::string>& extraDirectories() const { return extraDirectories_; }
 

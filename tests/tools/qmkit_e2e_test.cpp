@@ -238,28 +238,46 @@ TEST_F(QmkitInspect, ItsOutputAndExitStatus) {
     const std::string filters = kStudio + "Filters.bundle";
     const std::string noSdks = dir.file("no-sdks");
     const std::string usage = "usage: qmkit inspect BUNDLE";
+    const std::string shareSdk = kExamples + "/SDKs/ovaro.share-services.plist";
+    const std::string notAPlugIn = dir.file("Plain.bundle");
+    fs::create_directories(notAPlugIn);
+    qmtest::writeFile(notAPlugIn + "/Info.plist", R"(<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict><key>MRBundleIdentifier</key><string>x.plain</string></dict></plist>)");
     const Case cases[] = {
-        {{share}, 0,
-         {"plug-in ovaro.example.notes.share\n", "  path: " + share + "\n",
+        {{share, "-v"}, 0,
+         {"plug-in ovaro.example.notes.share\n", "  path: " + share + "\n", "  extension point: ovaro.share-services\n",
           "  containing application: " + kExamples + "/Applications/Notes.app\n", "  system volume: no\n",
-          "  sdk: ovaro.share-services\n", "  protocol: ShareServiceProtocol\n", "  version: 3.1\n",
+          "  sdk: ovaro.share-services (" + shareSdk + ")\n", "  protocol: ShareServiceProtocol\n", "  version: 3.1\n",
           "  hub protocol version: 2\n",
           "  data container: " + dir.file("data") + "/ovaro/Containers/ovaro.example.notes.share\n", "  valid: yes\n",
           "CleanTimeout: 30\n"},
          ""},
+        // Each value of the merged Info dictionary with where it came from.
+        {{share, "--provenance"}, 0,
+         {"    MRBundleVersion = 3.1  [bundle]\n", "    VTExtension/CleanTimeout = 30  [" + shareSdk + "]\n",
+          "    VTExtension/Shared = [\"Resources\",\"Help\",\"Templates\"]  [bundle + " + shareSdk + "]\n",
+          "    VTExtension/VTExtensionAttributes/ovaro.format = standard  [canonical]\n"},
+         ""},
         {{kNotes + "Spelling.bundle"}, 0, {"  data container: none (a data plug-in needs none)\n", "  protocol: #Data\n"}, ""},
         // The SDKs come from QM_SDK_PATH or --sdk-dir.
-        {{share}, 1, {}, "missing \"VTExtensionProtocol\" key in Info.plist or SDK (code 12)\n", {{"QM_SDK_PATH", noSdks}}},
+        {{share}, 1, {"  sdk: ovaro.share-services not found; looked in " + noSdks + "/ovaro.share-services.plist\n"},
+         "missing \"VTExtensionProtocol\" key in Info.plist or SDK (code 12)\n", {{"QM_SDK_PATH", noSdks}}},
         {{share, "--sdk-dir", kExamples + "/SDKs"}, 0, {"  valid: yes\n"}, "", {{"QM_SDK_PATH", noSdks}}},
-        {{kStudio + "Hybrid.bundle"}, 1, {"  valid: no\n"},
+        {{kStudio + "Hybrid.bundle"}, 1, {"  valid: no: hybrid plug-ins are not supported on this platform (code 12)\n"},
          "qmkit: plug-in ovaro.example.studio.hybrid in " + kStudio +
              "Hybrid.bundle: hybrid plug-ins are not supported on this platform (code 12)\n"},
+        // Paths that are no plug-in bundle say which way.
         {{filters, "-i", "ovaro.example.studio.none"}, 1, {},
-         "qmkit: plug-in ovaro.example.studio.none in " + filters +
-             ": malformed plug-in dictionary in plug-in ovaro.example.studio.none at file://"},
+         "qmkit: no plug-in ovaro.example.studio.none in the bundle at " + filters +
+             "; it has ovaro.example.studio.blur, ovaro.example.studio.sharpen (code 12)\n"},
         {{kStudio + "Broken.bundle"}, 1, {},
          "qmkit: unreadable Info dictionary in plug-in bundle at " + kStudio + "Broken.bundle: "},
-        {{dir.file("Nowhere.bundle")}, 1, {}, "qmkit: no plug-in bundle at " + dir.file("Nowhere.bundle") + " (code 9)\n"},
+        {{dir.file("Nowhere.bundle")}, 1, {}, "qmkit: no plug-in bundle at " + dir.file("Nowhere.bundle") + ": no such path (code 9)\n"},
+        {{notAPlugIn + "/Info.plist"}, 1, {}, "qmkit: no plug-in bundle at " + notAPlugIn + "/Info.plist: not a directory (code 9)\n"},
+        {{dir.path()}, 1, {}, "qmkit: no plug-in bundle at " + dir.path() + ": no Info.plist"},
+        {{kExamples + "/Applications/Notes.app"}, 1, {},
+         "Notes.app is an application, not a plug-in bundle; its plug-ins: " + kNotes + "LegacyImport.bundle, "},
+        {{notAPlugIn}, 1, {}, "declares no plug-in: its Info dictionary has neither \"VTExtension\" nor \"Quamber\" (code 12)\n"},
         {{}, 2, {}, usage},
         {{"--frobnicate", share}, 2, {}, usage},
         {{share, "-i"}, 2, {}, usage},
@@ -277,25 +295,41 @@ TEST_F(QmkitInspect, ItsOutputAndExitStatus) {
     }
 }
 
-// What the form holds is the model's test; here that it is printed whole.
-TEST_F(QmkitInspect, JsonPrintsTheFormOrEveryFormOfTheBundle) {
-    Value form = json({kNotes + "ShareToNotes.bundle"});
-    EXPECT_EQ(at(form, {"identifier"}), Value("ovaro.example.notes.share"));
-    EXPECT_EQ(at(form, {"systemResident"}), Value(false));
-    EXPECT_EQ(at(form, {"bundleInfo", "VTExtension", "CleanTimeout"}), Value(30));
-    EXPECT_TRUE(at(form, {"uuid"}).asString() && qm::Uuid::parse(*at(form, {"uuid"}).asString()));
+// What the form holds is the model's test; here that -v prints it whole and
+// that the JSON carries the verdict and the provenance.
+TEST_F(QmkitInspect, JsonCarriesTheVerdictTheFormAndTheProvenance) {
+    Value share = json({kNotes + "ShareToNotes.bundle", "-v", "--provenance"});
+    EXPECT_EQ(at(share, {"valid"}), Value(true));
+    EXPECT_EQ(at(share, {"sdk", "file"}), Value(kExamples + "/SDKs/ovaro.share-services.plist"));
+    EXPECT_EQ(at(share, {"form", "identifier"}), Value("ovaro.example.notes.share"));
+    EXPECT_EQ(at(share, {"form", "systemResident"}), Value(false));
+    EXPECT_EQ(at(share, {"form", "bundleInfo", "VTExtension", "CleanTimeout"}), Value(30));
+    const qm::Array* origins = at(share, {"provenance"}).asArray();
+    ASSERT_TRUE(origins);
+    const Value cleanTimeout(qm::Dictionary{{"key", Value(qm::Array{Value("VTExtension"), Value("CleanTimeout")})},
+                                            {"value", Value(30)},
+                                            {"source", Value("sdk")},
+                                            {"file", Value(kExamples + "/SDKs/ovaro.share-services.plist")}});
+    EXPECT_NE(std::find(origins->begin(), origins->end(), cleanTimeout), origins->end());
 
-    Value widget = json({kNotes + "NotesWidget.xbun"}, {{"QM_SYSTEM_ROOTS", kExamples + "/Applications"}});
-    EXPECT_EQ(at(widget, {"systemResident"}), Value(true));
-    EXPECT_EQ(at(widget, {"info", "PrincipalClass"}), Value("VTObject"));
+    Value widget = json({kNotes + "NotesWidget.xbun", "-v"}, {{"QM_SYSTEM_ROOTS", kExamples + "/Applications"}});
+    EXPECT_EQ(at(widget, {"form", "systemResident"}), Value(true));
+    EXPECT_EQ(at(widget, {"form", "info", "PrincipalClass"}), Value("VTObject"));
 
     Value forms = json({kStudio + "Filters.bundle"});
     ASSERT_TRUE(forms.isArray() && forms.asArray()->size() == 2) << forms.description();
     EXPECT_EQ(at(forms.asArray()->at(0), {"identifier"}), Value("ovaro.example.studio.blur"));
     EXPECT_EQ(at(forms.asArray()->at(1), {"identifier"}), Value("ovaro.example.studio.sharpen"));
-    Value one = json({kStudio + "Filters.bundle", "-i", "ovaro.example.studio.sharpen"});
-    EXPECT_EQ(at(one, {"identifier"}), Value("ovaro.example.studio.sharpen"));
-    EXPECT_EQ(at(one, {"version"}), Value("1.1"));
+    EXPECT_EQ(at(json({kStudio + "Filters.bundle", "-i", "ovaro.example.studio.sharpen"}), {"version"}), Value("1.1"));
+
+    for (const std::string& invalid : {kStudio + "Inspector.xbun", kStudio + "Nowhere.bundle"}) {
+        auto result = inspect({invalid, "--json"});
+        EXPECT_EQ(result.exitStatus, 1);
+        auto parsed = qm::json::parse(result.out);
+        ASSERT_TRUE(parsed.ok()) << result.out;
+        EXPECT_EQ(at(*parsed, {"valid"}), Value(false));
+        EXPECT_EQ(at(*parsed, {"error", "code"}), Value(invalid.ends_with(".xbun") ? 12 : 9));
+    }
 }
 
 // Each way a hold ends; the daemon goes last. Relative paths are the

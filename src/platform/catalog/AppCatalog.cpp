@@ -18,10 +18,6 @@ Error catalogError(AppCatalogError code, std::string description) {
     return Error{kAppCatalogErrorDomain, static_cast<std::int64_t>(code), std::move(description)};
 }
 
-bool looksLikeApplication(const std::string& path) {
-    return path.ends_with(".app") || !plugInsFoldersOf(path).empty();
-}
-
 // Runs work on the queue's worker and waits for its result.
 template <class Work>
 MaybeError runOnWorker(SerialQueue& queue, Work&& work) {

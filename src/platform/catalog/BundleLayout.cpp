@@ -79,6 +79,10 @@ std::vector<std::string> plugInsFoldersOf(const std::string& application) {
     return folders;
 }
 
+bool looksLikeApplication(const std::string& path) {
+    return path.ends_with(".app") || !plugInsFoldersOf(path).empty();
+}
+
 std::optional<std::string> containingApplicationPath(const std::string& bundlePath) {
     std::string plugIns = parentFolderOf(bundlePath);
     if (lastComponentOf(plugIns) != kPlugInsFolder) {

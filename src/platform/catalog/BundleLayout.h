@@ -26,6 +26,10 @@ std::vector<std::string> applicationsInRoot(const std::string& root);
 // The application's plug-ins folders that exist: PlugIns/ and Contents/PlugIns/.
 std::vector<std::string> plugInsFoldersOf(const std::string& application);
 
+// Whether the directory looks like an application: its name ends in ".app"
+// or it has a plug-ins folder.
+bool looksLikeApplication(const std::string& path);
+
 // The application whose plug-ins folder holds the bundle, by the layout
 // above; nothing when the bundle lies elsewhere.
 std::optional<std::string> containingApplicationPath(const std::string& bundlePath);
