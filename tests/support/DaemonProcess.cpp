@@ -66,7 +66,7 @@ int openForWriting(const std::string& path) {
 }  // namespace
 
 DaemonProcess::DaemonProcess(std::vector<std::string> arguments, const std::map<std::string, std::string>& environment,
-                             std::string serviceName)
+                             std::string serviceName, std::vector<std::string> launcher)
     : serviceName_(std::move(serviceName)) {
     std::map<std::string, std::string> env = environment;
     env.merge(std::map<std::string, std::string>{{"QM_DUCT_DIR", scratch_.file("duct")}, {"QM_LOG_STDERR", "1"},
@@ -76,12 +76,20 @@ DaemonProcess::DaemonProcess(std::vector<std::string> arguments, const std::map<
     runtimeDirectory_ = env["QM_DUCT_DIR"];
     logPath_ = scratch_.file("qmd.log");
     arguments.insert(arguments.begin(), {QMD_BINARY_PATH, "-S", serviceName_});
+    if (!launcher.empty()) {
+        std::string commandLine;
+        for (const std::string& argument : arguments) {
+            commandLine += (commandLine.empty() ? "" : " ") + argument;
+        }
+        launcher.push_back(commandLine);
+        arguments = std::move(launcher);
+    }
     int logFd = openForWriting(logPath_);
     pid_ = spawn(arguments, env, {-1, -1, logFd});
     ::close(logFd);
-    eventually([&] { return FramePeer::canConnect(socketPath()) || !running(); }, std::chrono::seconds(10));
+    eventually([&] { return FramePeer::canConnect(socketPath()) || !running(); }, std::chrono::seconds(20));
     if (!FramePeer::canConnect(socketPath())) {
-        ADD_FAILURE() << "qmd did not listen within 10 s, or exited: " << log();
+        ADD_FAILURE() << "qmd did not listen within 20 s, or exited: " << log();
     }
 }
 

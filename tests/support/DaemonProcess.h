@@ -17,9 +17,11 @@ namespace qmtest {
 class DaemonProcess {
 public:
     // `arguments` follow the program name and -S; `environment` is added to
-    // (or replaces) the test's own.
+    // (or replaces) the test's own. A `launcher` (a tracer such as
+    // `bpftrace ... -c`) is run instead, with the daemon's command line as its
+    // last argument, in one string; pid() is then the launcher's.
     explicit DaemonProcess(std::vector<std::string> arguments = {}, const std::map<std::string, std::string>& environment = {},
-                           std::string serviceName = "qmtest.qmd");
+                           std::string serviceName = "qmtest.qmd", std::vector<std::string> launcher = {});
     ~DaemonProcess();
     DaemonProcess(const DaemonProcess&) = delete;
     DaemonProcess& operator=(const DaemonProcess&) = delete;
