@@ -9,7 +9,7 @@
 #include <filesystem>
 #include <fstream>
 #include <map>
-#include <regex>
+#include <sstream>
 
 #include "support/DaemonProcess.h"
 #include "support/Eventually.h"
@@ -103,10 +103,15 @@ TEST(Probes, EachFiresWhereItsRequestIsServedWithItsArguments) {
     ASSERT_TRUE(daemon.waitForExit(std::chrono::seconds(20)));
     const std::string trace = qmtest::readFile(traced);
 
+    // Lines of the count map: "@[usdt:<binary>:qmd:<probe>]: <count>".
     std::map<std::string, int> counts;
-    const std::regex counted(R"(@\[usdt:[^\]]*:qmd:(\w+)\]: (\d+))");
-    for (std::sregex_iterator found(trace.begin(), trace.end(), counted), end; found != end; ++found) {
-        counts[(*found)[1]] = std::stoi((*found)[2]);
+    std::istringstream traceLines(trace);
+    for (std::string line; std::getline(traceLines, line);) {
+        const std::size_t name = line.rfind(":qmd:");
+        const std::size_t end = line.find("]: ");
+        if (line.starts_with("@[usdt:") && name != std::string::npos && end != std::string::npos && name < end) {
+            counts[line.substr(name + 5, end - name - 5)] = std::stoi(line.substr(end + 3));
+        }
     }
     const std::map<std::string, int> expected{
         {"req__add", 1},      {"req__remove", 2},   {"req__bulk", 1},       {"req__holddown", 1},
