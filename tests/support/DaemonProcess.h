@@ -17,9 +17,12 @@ namespace qmtest {
 class DaemonProcess {
 public:
     // `arguments` follow the program name and -S; `environment` is added to
-    // (or replaces) the test's own.
+    // (or replaces) the test's own. With `passedSockets`, the daemon gets them
+    // as systemd socket activation passes them (descriptors 3, 4, ...,
+    // LISTEN_FDS, LISTEN_PID) and the constructor does not wait for a socket
+    // of its own.
     explicit DaemonProcess(std::vector<std::string> arguments = {}, const std::map<std::string, std::string>& environment = {},
-                           std::string serviceName = "qmtest.qmd");
+                           std::string serviceName = "qmtest.qmd", const std::vector<int>& passedSockets = {});
     ~DaemonProcess();
     DaemonProcess(const DaemonProcess&) = delete;
     DaemonProcess& operator=(const DaemonProcess&) = delete;
