@@ -9,7 +9,7 @@ export ASAN_OPTIONS ?= detect_leaks=1:abort_on_error=1:strict_string_checks=1
 export UBSAN_OPTIONS ?= print_stacktrace=1:halt_on_error=1
 export TSAN_OPTIONS ?= halt_on_error=1:second_deadlock_stack=1
 
-.PHONY: all deps build run test test-plain test-asan test-tsan bench clean
+.PHONY: all deps build run test test-plain test-asan test-tsan bench install clean
 
 all: build
 
@@ -44,6 +44,11 @@ test-tsan: deps
 
 bench: build
 	build/bench/qmd_bench
+
+# Installs under $(PREFIX); DESTDIR, when set, stages the files there.
+PREFIX ?= /usr/local
+install: build
+	DESTDIR="$(DESTDIR)" cmake --install build --prefix "$(PREFIX)"
 
 clean:
 	rm -rf build build-asan build-tsan

@@ -72,7 +72,7 @@ TEST(Probes, EachFiresWhereItsRequestIsServedWithItsArguments) {
     qmtest::DaemonProcess daemon({}, {{"QM_SYSTEM_ROOTS", dir.file("system")},
                                       {"QM_SDK_PATH", std::string(QM_SOURCE_DIR) + "/examples/SDKs"},
                                       {"XDG_STATE_HOME", dir.file("state")}},
-                                 "qmtest.qmd", {kBpftrace, "-o", traced, "-e", script, "-c"});
+                                 "qmtest.qmd", {.launcher = {kBpftrace, "-o", traced, "-e", script, "-c"}, .passedSockets = {}});
     qmtest::FramePeer client(daemon.socketPath());
     auto send = [&](Dictionary request, std::optional<std::uint64_t> error = std::nullopt) {
         request.set("version", Value(std::uint64_t{3}));

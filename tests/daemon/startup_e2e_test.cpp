@@ -1,6 +1,8 @@
 // Starting qmd: its command line, its claim on the service name, socket
 // activation and the idle exit.
 
+#include <netinet/in.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -105,29 +107,62 @@ TEST(Startup, AStaleSocketFileIsReplaced) {
     EXPECT_TRUE(client.roundTrip(bulk()));
 }
 
-TEST(Startup, ASocketPassedByTheServiceManagerIsUsed) {
+// As systemd passes it: the daemon serves the first socket, claims none of
+// its own, closes the extra ones, and leaves the socket file on SIGTERM for
+// the next activation.
+TEST(Startup, ASocketPassedByTheServiceManagerIsServedAndOutlivesTheDaemon) {
     qmtest::TempDir dir;
     std::string path = dir.file("activated.sock");
-    qm::UniqueFd listener = FramePeer::listenAt(path);
-    std::string duct = dir.file("duct");
-    pid_t pid = ::fork();
-    if (pid == 0) {
-        ::dup2(::dup(listener.get()), 3);  // the copy drops close-on-exec, even were the listener fd 3
-        std::string pidText = std::to_string(::getpid());
-        ::setenv("LISTEN_FDS", "1", 1);
-        ::setenv("LISTEN_PID", pidText.c_str(), 1);
-        ::setenv("QM_DUCT_DIR", duct.c_str(), 1);
-        ::execl(QMD_BINARY_PATH, QMD_BINARY_PATH, "-S", "activated.qmd", static_cast<char*>(nullptr));
-        ::_exit(127);
-    }
-    listener.reset();
+    DaemonProcess daemon({}, {}, "activated.qmd",
+                         {.launcher = {}, .passedSockets = {FramePeer::listenAt(path).get(), FramePeer::listenAt(dir.file("extra.sock")).get()}});
     FramePeer client(path);
-    auto reply = client.roundTrip(bulk());
-    EXPECT_TRUE(reply);
-    // It did not claim a socket of its own.
-    EXPECT_FALSE(FramePeer::canConnect(duct + "/activated.qmd"));
-    ::kill(pid, SIGKILL);
-    ::waitpid(pid, nullptr, 0);
+    EXPECT_TRUE(client.roundTrip(bulk()));
+    EXPECT_FALSE(FramePeer::canConnect(daemon.socketPath()));
+    EXPECT_FALSE(FramePeer::canConnect(dir.file("extra.sock")));
+    EXPECT_NE(daemon.log().find("ignoring descriptor 4"), std::string::npos) << daemon.log();
+
+    ::kill(daemon.pid(), SIGTERM);
+    auto status = daemon.waitForExit(std::chrono::seconds(10));
+    ASSERT_TRUE(status);
+    EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 0) << daemon.log();
+    struct stat info{};
+    EXPECT_EQ(::stat(path.c_str(), &info), 0) << "the passed socket's file was removed";
+    EXPECT_TRUE(S_ISSOCK(info.st_mode));
+}
+
+// A passed descriptor that cannot serve, or a runtime directory that is not
+// private, ends the start with a line that names the cause.
+TEST(Startup, APassedSocketThatCannotServeIsRefused) {
+    qmtest::TempDir dir;
+    std::string openDuct = dir.file("open");
+    ASSERT_EQ(::mkdir(openDuct.c_str(), 0700), 0);
+    ASSERT_EQ(::chmod(openDuct.c_str(), 0755), 0);
+    sockaddr_in loopback{};
+    loopback.sin_family = AF_INET;
+    loopback.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    qm::UniqueFd tcp(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    ASSERT_EQ(::bind(tcp.get(), reinterpret_cast<const sockaddr*>(&loopback), sizeof loopback), 0);
+    ASSERT_EQ(::listen(tcp.get(), 1), 0);
+    const std::string notServing = "is not a listening Unix-domain stream socket";
+    // {descriptor, runtime directory (empty: the daemon's own), what the log says}
+    const std::tuple<qm::UniqueFd, std::string, std::string> cases[] = {
+        {qm::UniqueFd(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0)), "", notServing},
+        {qm::UniqueFd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)), "", notServing},
+        {std::move(tcp), "", notServing},
+        {FramePeer::listenAt(dir.file("good.sock")), openDuct, "has mode 0755"},
+    };
+    for (const auto& [fd, duct, says] : cases) {
+        std::map<std::string, std::string> environment;
+        if (!duct.empty()) {
+            environment["QM_DUCT_DIR"] = duct;
+        }
+        DaemonProcess daemon({}, environment, "refused.qmd", {.launcher = {}, .passedSockets = {fd.get()}});
+        auto status = daemon.waitForExit(std::chrono::seconds(10));
+        ASSERT_TRUE(status) << says;
+        EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 1) << says;
+        EXPECT_NE(daemon.log().find(says), std::string::npos) << daemon.log();
+        EXPECT_NE(daemon.log().find("unable to construct server"), std::string::npos) << daemon.log();
+    }
 }
 
 // The daemon ends in order: exit 0, one line, its own socket removed.

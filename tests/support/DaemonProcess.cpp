@@ -8,6 +8,7 @@
 #include <gtest/gtest.h>
 
 #include <array>
+#include <cstring>
 #include <filesystem>
 
 #include "support/Eventually.h"
@@ -19,7 +20,14 @@ namespace {
 
 // Starts the program with `extra` added to (or replacing) the test's own
 // environment, its standard streams on the given descriptors (-1: the test's).
-pid_t spawn(std::vector<std::string> argv, const std::map<std::string, std::string>& extra, std::array<int, 3> streams) {
+// `passed` descriptors become 3, 4, ... with LISTEN_FDS and LISTEN_PID set, as
+// systemd passes sockets.
+pid_t spawn(std::vector<std::string> argv, std::map<std::string, std::string> extra, std::array<int, 3> streams,
+            const std::vector<int>& passed = {}) {
+    if (!passed.empty()) {
+        extra["LISTEN_FDS"] = std::to_string(passed.size());
+        extra["LISTEN_PID"] = std::string(20, '0');  // the child writes its pid here
+    }
     std::vector<std::string> environment;
     for (const auto& [k, v] : extra) {
         environment.push_back(k + "=" + v);
@@ -30,20 +38,47 @@ pid_t spawn(std::vector<std::string> argv, const std::map<std::string, std::stri
         }
     }
     std::vector<char*> argp, envp;
+    char* listenPid = nullptr;
     for (auto& a : argv) {
         argp.push_back(a.data());
     }
     for (auto& e : environment) {
         envp.push_back(e.data());
+        if (e.starts_with("LISTEN_PID=")) {
+            listenPid = e.data() + std::strlen("LISTEN_PID=");
+        }
     }
     argp.push_back(nullptr);
     envp.push_back(nullptr);
+    constexpr int kFirstHighDescriptor = 100;
+    std::vector<int> high(passed.size());  // allocated before fork
     pid_t pid = ::fork();
     if (pid == 0) {
+        // Only async-signal-safe calls from here on.
         for (int fd = 0; fd < 3; ++fd) {
             if (streams[static_cast<std::size_t>(fd)] >= 0) {
                 ::dup2(streams[static_cast<std::size_t>(fd)], fd);
             }
+        }
+        if (listenPid != nullptr) {
+            // Out of the way first, so that moving one to 3 + i never
+            // overwrites another still to move.
+            for (std::size_t i = 0; i < passed.size(); ++i) {
+                high[i] = ::fcntl(passed[i], F_DUPFD, kFirstHighDescriptor);
+            }
+            for (std::size_t i = 0; i < passed.size(); ++i) {
+                ::dup2(high[i], 3 + static_cast<int>(i));  // dup2 clears close-on-exec
+                ::close(high[i]);
+            }
+            char digits[24];
+            int count = 0;
+            for (auto n = static_cast<unsigned long>(::getpid()); n > 0; n /= 10) {
+                digits[count++] = static_cast<char>('0' + n % 10);
+            }
+            while (count > 0) {
+                *listenPid++ = digits[--count];
+            }
+            *listenPid = '\0';
         }
         ::execve(argp[0], argp.data(), envp.data());
         ::_exit(127);
@@ -66,7 +101,7 @@ int openForWriting(const std::string& path) {
 }  // namespace
 
 DaemonProcess::DaemonProcess(std::vector<std::string> arguments, const std::map<std::string, std::string>& environment,
-                             std::string serviceName, std::vector<std::string> launcher)
+                             std::string serviceName, Launch launch)
     : serviceName_(std::move(serviceName)) {
     std::map<std::string, std::string> env = environment;
     env.merge(std::map<std::string, std::string>{{"QM_DUCT_DIR", scratch_.file("duct")}, {"QM_LOG_STDERR", "1"},
@@ -76,17 +111,20 @@ DaemonProcess::DaemonProcess(std::vector<std::string> arguments, const std::map<
     runtimeDirectory_ = env["QM_DUCT_DIR"];
     logPath_ = scratch_.file("qmd.log");
     arguments.insert(arguments.begin(), {QMD_BINARY_PATH, "-S", serviceName_});
-    if (!launcher.empty()) {
+    if (!launch.launcher.empty()) {
         std::string commandLine;
         for (const std::string& argument : arguments) {
             commandLine += (commandLine.empty() ? "" : " ") + argument;
         }
-        launcher.push_back(commandLine);
-        arguments = std::move(launcher);
+        launch.launcher.push_back(commandLine);
+        arguments = std::move(launch.launcher);
     }
     int logFd = openForWriting(logPath_);
-    pid_ = spawn(arguments, env, {-1, -1, logFd});
+    pid_ = spawn(arguments, env, {-1, -1, logFd}, launch.passedSockets);
     ::close(logFd);
+    if (!launch.passedSockets.empty()) {
+        return;  // peers may connect at once: the passed socket already listens
+    }
     eventually([&] { return FramePeer::canConnect(socketPath()) || !running(); }, std::chrono::seconds(20));
     if (!FramePeer::canConnect(socketPath())) {
         ADD_FAILURE() << "qmd did not listen within 20 s, or exited: " << log();

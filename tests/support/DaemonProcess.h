@@ -17,11 +17,19 @@ namespace qmtest {
 class DaemonProcess {
 public:
     // `arguments` follow the program name and -S; `environment` is added to
-    // (or replaces) the test's own. A `launcher` (a tracer such as
-    // `bpftrace ... -c`) is run instead, with the daemon's command line as its
-    // last argument, in one string; pid() is then the launcher's.
+    // (or replaces) the test's own.
+    struct Launch {
+        // Run instead of the daemon (a tracer such as `bpftrace ... -c`), with
+        // the daemon's command line as its last argument, in one string;
+        // pid() is then the launcher's.
+        std::vector<std::string> launcher;
+        // Given to the daemon as systemd socket activation passes them
+        // (descriptors 3, 4, ..., LISTEN_FDS, LISTEN_PID); the constructor
+        // then does not wait for a socket of the daemon's own.
+        std::vector<int> passedSockets;
+    };
     explicit DaemonProcess(std::vector<std::string> arguments = {}, const std::map<std::string, std::string>& environment = {},
-                           std::string serviceName = "qmtest.qmd", std::vector<std::string> launcher = {});
+                           std::string serviceName = "qmtest.qmd", Launch launch = {});
     ~DaemonProcess();
     DaemonProcess(const DaemonProcess&) = delete;
     DaemonProcess& operator=(const DaemonProcess&) = delete;

@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <cstddef>
 #include <cstring>
+#include <vector>
 
 #include "platform/env/Environment.h"
 #include "platform/log/SystemLog.h"
@@ -18,13 +19,18 @@ namespace {
 
 constexpr int kMaxAcceptsPerTurn = 64;
 
-bool isListeningStreamSocket(int fd) {
+bool socketOption(int fd, int option, int& value) {
+    socklen_t length = sizeof value;
+    return ::getsockopt(fd, SOL_SOCKET, option, &value, &length) == 0;
+}
+
+// What the daemon can serve on: a Unix-domain stream socket already listening.
+bool isListeningUnixStreamSocket(int fd) {
     int accepting = 0;
-    socklen_t length = sizeof accepting;
+    int domain = 0;
     int type = 0;
-    socklen_t typeLength = sizeof type;
-    return ::getsockopt(fd, SOL_SOCKET, SO_ACCEPTCONN, &accepting, &length) == 0 && accepting &&
-           ::getsockopt(fd, SOL_SOCKET, SO_TYPE, &type, &typeLength) == 0 && type == SOCK_STREAM;
+    return socketOption(fd, SO_ACCEPTCONN, accepting) && accepting != 0 && socketOption(fd, SO_DOMAIN, domain) &&
+           domain == AF_UNIX && socketOption(fd, SO_TYPE, type) && type == SOCK_STREAM;
 }
 
 std::string boundPath(int fd) {
@@ -35,6 +41,32 @@ std::string boundPath(int fd) {
         return {};
     }
     return std::string(address.sun_path, ::strnlen(address.sun_path, length - offsetof(sockaddr_un, sun_path)));
+}
+
+// Takes the first socket passed by the service manager and closes the rest:
+// one service, one socket. The runtime directory is checked as when binding,
+// since the service manager made it; no "already running" probe, since the
+// service manager owns the socket and starts one daemon on it.
+Result<UniqueFd> adoptPassedSocket(std::vector<int> passed) {
+    UniqueFd socket(passed.front());
+    for (std::size_t i = 1; i < passed.size(); ++i) {
+        systemLogf(kLogNotice, "ignoring descriptor %d passed by the service manager: one socket is served", passed[i]);
+        ::close(passed[i]);
+    }
+    if (auto directory = prepareRuntimeDirectory(); !directory) {
+        return directory.error();
+    }
+    if (!isListeningUnixStreamSocket(socket.get())) {
+        return Error{kDuctErrorDomain, ENOTSOCK,
+                     "descriptor " + std::to_string(socket.get()) +
+                         " passed by the service manager (LISTEN_FDS) is not a listening Unix-domain stream socket"};
+    }
+    int flags = ::fcntl(socket.get(), F_GETFL);
+    if (flags < 0 || ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK) != 0 ||
+        ::fcntl(socket.get(), F_SETFD, FD_CLOEXEC) != 0) {
+        return posixError(errno, "cannot make the passed socket non-blocking and close-on-exec");
+    }
+    return socket;
 }
 
 }  // namespace
@@ -49,26 +81,13 @@ Result<std::shared_ptr<Listener>> Listener::create(EventLoop& loop, const std::s
     }
     auto activated = takeSocketActivationDescriptors();
     if (!activated.empty()) {
-        // The service manager made the folder; it must still be ours alone.
-        if (auto directory = prepareRuntimeDirectory(); !directory) {
-            for (int fd : activated) {
-                ::close(fd);
-            }
-            return directory.error();
+        auto socket = adoptPassedSocket(std::move(activated));
+        if (!socket) {
+            return socket.error();
         }
-        UniqueFd socket(activated.front());
-        for (std::size_t i = 1; i < activated.size(); ++i) {
-            ::close(activated[i]);  // one service, one socket
-        }
-        if (!isListeningStreamSocket(socket.get())) {
-            return Error{kDuctErrorDomain, EBADF, "the socket passed by the service manager is not a listening stream socket"};
-        }
-        int flags = ::fcntl(socket.get(), F_GETFL);
-        ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK);
-        ::fcntl(socket.get(), F_SETFD, FD_CLOEXEC);
-        std::string path = boundPath(socket.get());
-        return std::shared_ptr<Listener>(new Listener(loop, serviceName, eventQueue, std::move(socket), UniqueFd(),
-                                                      std::move(path), false, std::move(budget)));
+        std::string path = boundPath(socket->get());
+        return std::shared_ptr<Listener>(new Listener(loop, serviceName, eventQueue, std::move(socket).value(),
+                                                      UniqueFd(), std::move(path), false, std::move(budget)));
     }
     auto claimed = openServiceSocket(serviceName);
     if (!claimed) {
