@@ -68,7 +68,11 @@ TEST(Probes, EachFiresWhereItsRequestIsServedWithItsArguments) {
                                "usdt:" + qmd + ":qmd:plugin__add, usdt:" + qmd +
                                ":qmd:plugin__ready { printf(\"%s %s\\n\", probe, str(arg0)); }\n" + "usdt:" + qmd +
                                ":qmd:plugin__remove, usdt:" + qmd +
-                               ":qmd:db__load { printf(\"%s %s %d\\n\", probe, str(arg0), arg1); }\n";
+                               ":qmd:db__load { printf(\"%s %s %d\\n\", probe, str(arg0), arg1); }\n" +
+                               // The README's latency and holds one-liners attach to these two functions.
+                               "uretprobe:" + qmd + ":_ZN11Transaction8dispatchEv { @dispatched = count(); }\n" +
+                               "uretprobe:" + qmd + ":_ZN8HoldList7addHoldESt10shared_ptrIK13QMDPlugInHoldE " +
+                               "/retval & 1/ { @holds_taken = count(); }\n";
     qmtest::DaemonProcess daemon({}, {{"QM_SYSTEM_ROOTS", dir.file("system")},
                                       {"QM_SDK_PATH", std::string(QM_SOURCE_DIR) + "/examples/SDKs"},
                                       {"XDG_STATE_HOME", dir.file("state")}},
@@ -119,6 +123,8 @@ TEST(Probes, EachFiresWhereItsRequestIsServedWithItsArguments) {
         {"plugin__add", 1},   {"plugin__remove", 2}, {"plugin__ready", 1},  {"db__load", 1},
     };
     EXPECT_EQ(counts, expected) << trace;
+    EXPECT_NE(trace.find("@dispatched: 10\n"), std::string::npos) << trace;
+    EXPECT_NE(trace.find("@holds_taken: 1\n"), std::string::npos) << trace;
     const std::string lines[] = {
         ":qmd:plugin__add " + extra + "\n",
         ":qmd:plugin__remove " + extra + " 1\n",
