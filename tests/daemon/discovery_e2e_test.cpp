@@ -304,7 +304,7 @@ TEST_F(Discovery, AnApplicationWithABusyPlugInCannotBeHeld) {
     ASSERT_GT(running.pid(), 0);
     Value refused = holdNotes();
     running.reap();
-    EXPECT_EQ(errorCode(refused), 14u);
+    ASSERT_EQ(errorCode(refused), 14u);
     EXPECT_EQ(errorText(refused), "plug-ins are busy");
     EXPECT_EQ(*refused.get("conflicts"),
               Value(Array{Value(Dictionary{{"MRBundleIdentifier", Value("ovaro.example.notes.share")}})}));
