@@ -161,21 +161,6 @@ TEST(OfflineLayout, TheContainingApplicationComesFromThePlugInsFolder) {
     }
 }
 
-TEST(OfflineLayout, DeclaredIdentifiersFollowTheCatalogsRule) {
-    Value named = dict({{"VTExtensionAttributes", dict({{"VTExtensionIdentifier", "n"}})}});
-    const std::pair<Value, std::vector<std::string>> cases[] = {
-        {dict({{"MRBundleIdentifier", "b"}, {"VTExtension", named}}), {"n"}},
-        {dict({{"MRBundleIdentifier", "b"}, {"Quamber", dict({{"Attributes", dict({{"ovaro.identifier", "o"}})}})}}), {"o"}},
-        {dict({{"MRBundleIdentifier", "b"}, {"Quamber", dict({{"Multiple", dict({{"m1", dict({})}, {"m2", dict({})}})}})}}),
-         {"m1", "m2"}},
-        {dict({{"MRBundleIdentifier", "b"}, {"VTExtension", dict({})}}), {"b"}},
-        {dict({{"VTExtension", dict({})}}), {}},
-    };
-    for (const auto& [info, identifiers] : cases) {
-        EXPECT_EQ(OfflinePlugIns::declaredIdentifiers(info), identifiers) << info.description();
-    }
-}
-
 TEST(OfflineLayout, TheHubProtocolVersionFollowsTheDaemonsRule) {
     const std::tuple<Value, const char*, unsigned> cases[] = {
         {dict({{"Quamber", dict({})}, {"VTExtension", dict({{"HubProtocolVersion", 3}})}}), "/p.bundle", 3},  // declared

@@ -26,15 +26,11 @@ namespace fs = std::filesystem;
 using qm::AppCatalog;
 using qm::PlugInRecordPtr;
 using qm::Value;
+using qmtest::eventually;
 using qmtest::LogCapture;
+using qmtest::writePlist;
 
 using Dict = qm::Dictionary;
-
-void writePlist(const std::string& path, const Value& value) {
-    fs::create_directories(fs::path(path).parent_path());
-    ASSERT_FALSE(qm::plist::writeFileAtomically(path, value, qm::plist::Format::xml)) << path;
-    ::chmod(path.c_str(), 0644);
-}
 
 // A plug-in bundle's Info: new style unless told, with an executable unless
 // it is a data plug-in.
@@ -61,16 +57,6 @@ std::string writeBundle(const std::string& bundle, const Dict& info, bool deskto
 std::string resolved(const std::string& path) {
     auto r = qm::resolvedPath(path);
     return r ? *r : path;
-}
-
-bool eventually(const std::function<bool()>& condition) {
-    for (int i = 0; i < 500; ++i) {
-        if (condition()) {
-            return true;
-        }
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    return false;
 }
 
 // Records what it is told; checks that lookups, which never wait for the

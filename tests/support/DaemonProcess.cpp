@@ -163,29 +163,61 @@ std::size_t DaemonProcess::openDescriptorCount() const {
     return static_cast<std::size_t>(std::distance(entries, std::filesystem::directory_iterator()));
 }
 
-ProgramResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& environment,
-                         std::chrono::milliseconds timeout, const std::string& standardInput) {
-    TempDir scratch;
-    writeFile(scratch.file("in"), standardInput);
-    int in = ::open(scratch.file("in").c_str(), O_RDONLY | O_CLOEXEC);
-    int out = openForWriting(scratch.file("out"));
-    int err = openForWriting(scratch.file("err"));
-    pid_t pid = spawn(argv, environment, {in, out, err});
+std::map<std::string, std::string> exampleApplications(const TempDir& roots) {
+    std::filesystem::copy(std::string(QM_SOURCE_DIR) + "/examples/Applications", roots.file("system"),
+                          std::filesystem::copy_options::recursive);
+    return {{"QM_SYSTEM_ROOTS", roots.file("system")}, {"QM_SDK_PATH", std::string(QM_SOURCE_DIR) + "/examples/SDKs"}};
+}
+
+RunningProgram::RunningProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& environment,
+                               const std::string& standardInput)
+    : program_(argv.at(0)) {
+    writeFile(scratch_.file("in"), standardInput);
+    int in = ::open(scratch_.file("in").c_str(), O_RDONLY | O_CLOEXEC);
+    int out = openForWriting(scratch_.file("out"));
+    int err = openForWriting(scratch_.file("err"));
+    pid_ = spawn(argv, environment, {in, out, err});
     for (int fd : {in, out, err}) {
         ::close(fd);
     }
-    ProgramResult result;
-    auto status = waitPid(pid, timeout);
-    if (!status) {
-        ::kill(pid, SIGKILL);
-        waitPid(pid, std::chrono::seconds(5));
-        ADD_FAILURE() << argv[0] << " did not finish in time";
-    } else if (WIFEXITED(*status)) {
-        result.exitStatus = WEXITSTATUS(*status);
+}
+
+RunningProgram::~RunningProgram() {
+    if (pid_ > 0 && !result_) {
+        ::kill(pid_, SIGKILL);
+        waitPid(pid_, std::chrono::seconds(5));
     }
-    result.out = readFile(scratch.file("out"));
-    result.err = readFile(scratch.file("err"));
-    return result;
+}
+
+void RunningProgram::signal(int number) const {
+    EXPECT_GT(pid_, 0) << program_ << " is not running";
+    if (pid_ > 0 && !result_) {
+        ::kill(pid_, number);
+    }
+}
+
+ProgramResult RunningProgram::wait(std::chrono::milliseconds timeout) {
+    if (result_ || pid_ <= 0) {
+        return result_.value_or(ProgramResult{});
+    }
+    auto status = waitPid(pid_, timeout);
+    if (!status) {
+        ::kill(pid_, SIGKILL);
+        waitPid(pid_, std::chrono::seconds(5));
+        ADD_FAILURE() << program_ << " did not finish in time";
+    }
+    result_.emplace();
+    if (status && WIFEXITED(*status)) {
+        result_->exitStatus = WEXITSTATUS(*status);
+    }
+    result_->out = readFile(scratch_.file("out"));
+    result_->err = readFile(scratch_.file("err"));
+    return *result_;
+}
+
+ProgramResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& environment,
+                         std::chrono::milliseconds timeout, const std::string& standardInput) {
+    return RunningProgram(argv, environment, standardInput).wait(timeout);
 }
 
 }  // namespace qmtest

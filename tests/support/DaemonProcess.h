@@ -60,13 +60,43 @@ private:
     std::optional<int> status_;
 };
 
-// Runs a program to completion with the given standard input; exit status
-// and captured output.
+// Copies the example applications to <roots>/system; the environment of a
+// daemon that catalogs them, with the example SDKs.
+std::map<std::string, std::string> exampleApplications(const TempDir& roots);
+
+// A program's exit status and captured output.
 struct ProgramResult {
     int exitStatus = -1;  // -1 when killed by a signal
     std::string out;
     std::string err;
 };
+
+// A program started with the given standard input and left running, its
+// output going to files; killed and reaped when the object goes unwaited.
+class RunningProgram {
+public:
+    RunningProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& environment = {},
+                   const std::string& standardInput = "");
+    ~RunningProgram();
+    RunningProgram(const RunningProgram&) = delete;
+    RunningProgram& operator=(const RunningProgram&) = delete;
+
+    // The child's pid (-1 when it could not start); a program it execs keeps it.
+    pid_t pid() const { return pid_; }
+    // Signals the child while it runs; never any other process.
+    void signal(int number) const;
+    std::string outputSoFar() const { return readFile(scratch_.file("out")); }
+    // Waits for the exit (killing the program after the timeout, a test failure).
+    ProgramResult wait(std::chrono::milliseconds timeout = std::chrono::seconds(30));
+
+private:
+    TempDir scratch_;
+    std::string program_;
+    pid_t pid_ = -1;
+    std::optional<ProgramResult> result_;
+};
+
+// Runs a program to completion.
 ProgramResult runProgram(const std::vector<std::string>& argv, const std::map<std::string, std::string>& environment = {},
                          std::chrono::milliseconds timeout = std::chrono::seconds(30),
                          const std::string& standardInput = "");
