@@ -1,12 +1,14 @@
 # bash completion for qmkit, the command-line client of qmd.
 # Needs nothing but bash; works with or without the bash-completion package.
 
-# Plug-in UUIDs from the daemon: the first field of `qmkit list`, without
-# the "-" of bundles the catalog refused. $1 is the -S service, if any.
+# UUIDs of the plug-ins the daemon would use: the first field of the lines
+# of `qmkit list` that end in "valid" (refused bundles have "-" there, and
+# the daemon answers "no such plugin" for invalid ones). $1 is the -S
+# service, if any.
 _qmkit_plugin_uuids() {
     local -a service=()
     [[ -n $1 ]] && service=(-S "$1")
-    qmkit "${service[@]}" --timeout 2 list 2>/dev/null | cut -f1 | grep -v '^-$'
+    qmkit "${service[@]}" --timeout 2 list 2>/dev/null | awk -F '\t' '$1 != "-" && $6 == "valid" { print $1 }'
 }
 
 # Hold tokens: the first column of `qmkit holds`, below its header line.
@@ -16,10 +18,12 @@ _qmkit_hold_tokens() {
     qmkit "${service[@]}" --timeout 2 holds 2>/dev/null | awk 'NR > 1 { print $1 }'
 }
 
+# Extension points: the fourth field of `qmkit list`, without the "-" of
+# bundles that have none.
 _qmkit_extension_points() {
     local -a service=()
     [[ -n $1 ]] && service=(-S "$1")
-    qmkit "${service[@]}" --timeout 2 list 2>/dev/null | cut -f4 | sort -u
+    qmkit "${service[@]}" --timeout 2 list 2>/dev/null | awk -F '\t' '$4 != "-" { print $4 }' | sort -u
 }
 
 # Bundles and applications are directories.
@@ -32,7 +36,7 @@ _qmkit() {
     local cur=${COMP_WORDS[COMP_CWORD]}
     local prev=${COMP_WORDS[COMP_CWORD-1]}
     local commands="access bulk hold holds inspect list ready release send token watch"
-    local globals="-S --json --timeout --help --version"
+    local globals="-S --json --timeout --help -h --version"
     COMPREPLY=()
 
     # The global options before the command, and where the command is.
@@ -61,15 +65,20 @@ _qmkit() {
         return 0
     fi
 
-    local options="--help"
+    # Every command takes --help and -h.
+    local options="--help -h"
     case $command in
-        bulk|hold) options="--flags --help" ;;
-        inspect) options="-i --sdk-dir -v --provenance --json --help" ;;
-        list) options="--point --help" ;;
-        send) options="- --help" ;;
+        bulk|hold) options="--flags $options" ;;
+        inspect) options="-i --sdk-dir -v --provenance --json $options" ;;
+        list) options="--point $options" ;;
+        send) options="- $options" ;;
     esac
     case $prev in
-        --flags|-i) return 0 ;;
+        --flags)
+            # What hold's paths name: 1 applications, 2 plug-in bundles.
+            [[ $command == hold ]] && mapfile -t COMPREPLY < <(compgen -W "1 2" -- "$cur")
+            return 0 ;;
+        -i) return 0 ;;
         --sdk-dir) _qmkit_directories "$cur"; return 0 ;;
         --point)
             mapfile -t COMPREPLY < <(compgen -W "$(_qmkit_extension_points "$service")" -- "$cur")

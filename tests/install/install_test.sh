@@ -3,7 +3,8 @@
 # has systemd check the installed units, starts the installed qmd the way the
 # socket unit does (systemd-socket-activate), drives it with the installed
 # qmkit until it exits idle and is started again by the next connection, and
-# builds and runs the example client through pkg-config alone.
+# builds and runs the example client through pkg-config alone. The man pages
+# and the bash completion are in place, render and load.
 #
 #   install_test.sh BUILD-DIR LIBDIR [COMPILER-FLAGS]
 # LIBDIR is the build's CMAKE_INSTALL_LIBDIR; COMPILER-FLAGS are added to the
@@ -62,20 +63,42 @@ prefix="$tmp/prefix"
 cmake --install "$build" --prefix "$prefix" >/dev/null
 units="$prefix/lib/systemd/user"
 for file in bin/qmd bin/qmkit "$libdir/libqmclient.so" "$libdir/pkgconfig/qmclient.pc" \
-            include/qm/client/QMDaemonClient.h lib/systemd/user/qmd.socket lib/systemd/user/qmd.service; do
+            include/qm/client/QMDaemonClient.h lib/systemd/user/qmd.socket lib/systemd/user/qmd.service \
+            share/man/man8/qmd.8 share/man/man1/qmkit.1 share/bash-completion/completions/qmkit; do
     [ -e "$prefix/$file" ] || fail "$file was not installed"
 done
 grep -qx "ExecStart=$prefix/bin/qmd" "$units/qmd.service" || fail "ExecStart does not name the installed qmd"
 
+# --- The installed man pages render, without a formatter warning, both as
+# files and looked up by name in the installed tree, and are the pages of
+# docs/man.
+render() { LC_ALL=C MANPAGER=cat MANWIDTH=80 man "$@"; }
+for page in man8/qmd.8 man1/qmkit.1; do
+    name=$(basename "$page" | cut -d. -f1)
+    section=${page:3:1}
+    cmp -s "$prefix/share/man/$page" "$top/docs/man/$(basename "$page")" ||
+        fail "the installed $page is not docs/man/$(basename "$page")"
+    rendered=$(render --warnings -l "$prefix/share/man/$page" 2>"$tmp/man.err") ||
+        fail "man -l $page failed: $(cat "$tmp/man.err")"
+    [ ! -s "$tmp/man.err" ] || fail "man -l $page warns: $(cat "$tmp/man.err")"
+    grep -q "^NAME" <<<"$rendered" && grep -q "^ *$name - " <<<"$rendered" ||
+        fail "man -l $page renders no NAME section for $name: $rendered"
+    [ "$rendered" = "$(render -M "$prefix/share/man" "$section" "$name" 2>&1)" ] ||
+        fail "man -M $prefix/share/man $section $name does not find the installed page"
+done
+
+# --- The installed completion loads in a plain bash and completes the
+# subcommands (bash-completion finds it by the command's name).
+completed=$(bash --norc --noprofile -c 'source "$1" && complete -p qmkit >/dev/null &&
+    COMP_WORDS=(qmkit w) COMP_CWORD=1 && _qmkit && echo "${COMPREPLY[*]}"' _ \
+    "$prefix/share/bash-completion/completions/qmkit") || fail "the installed completion does not load"
+[ "$completed" = "watch" ] || fail "the installed completion completes \"qmkit w\" to \"$completed\""
+
 # --- systemd accepts the units: no error and no warning (an unknown key is
-# only a warning). The man pages are checked once they are installed.
-man=(--man=no)
-if [ -e "$prefix/share/man/man8/qmd.8" ]; then
-    man=(--man=yes)
-    export MANPATH="$prefix/share/man"
-fi
+# only a warning), and their Documentation= pages exist.
+export MANPATH="$prefix/share/man"
 mkdir -m 0700 "$tmp/run"
-verify=$(XDG_RUNTIME_DIR="$tmp/run" systemd-analyze verify --user "${man[@]}" "$units/qmd.socket" "$units/qmd.service" 2>&1) ||
+verify=$(XDG_RUNTIME_DIR="$tmp/run" systemd-analyze verify --user --man=yes "$units/qmd.socket" "$units/qmd.service" 2>&1) ||
     fail "systemd-analyze verify: $verify"
 [ -z "$verify" ] || fail "systemd-analyze verify warns: $verify"
 
