@@ -103,7 +103,10 @@ void Discovery::visit(const QMDPlugInPtr& plugIn, const qm::Dictionary* rules, c
         return;
     }
     for (std::size_t i = 0; exclusions && i < exclusions->size(); ++i) {
-        if (rules_.match(facts, (*exclusions)[i].asDictionary())) {
+        // An entry that is no rules dictionary excludes nothing (absent
+        // rules would match every plug-in).
+        const qm::Dictionary* exclusion = (*exclusions)[i].asDictionary();
+        if (exclusion && rules_.match(facts, exclusion)) {
             context_.logger.debug("client %d plugin %@ excluded", pid, identifier);
             explainPlugIn(*plugIn, "excluded", std::to_string(i));
             return;

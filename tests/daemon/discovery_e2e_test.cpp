@@ -242,11 +242,15 @@ TEST_F(Discovery, DuplicatesResolveByVersionAndReplacementsAreMarked) {
 TEST_F(Discovery, TheUsersExclusionsAreReadAgainWhenTheyChange) {
     Dictionary rules{{"VTExtensionPointName", Value("ovaro.share-services")}};
     ASSERT_EQ(identifiers(match(rules)).size(), 1u);
-    Value exclusions(Dictionary{
-        {"exclusions", Value(Array{Value(Dictionary{{"VTExtensionIdentifier", Value("ovaro.example.notes.share")}})})}});
     std::string prefs = qmd->scratchPath("config/ovaro/ovaro.quamber.userprefs.plist");
     fs::create_directories(fs::path(prefs).parent_path());
-    ASSERT_FALSE(qm::plist::writeFileAtomically(prefs, exclusions, qm::plist::Format::binary));
+    auto storeExclusions = [&](Array exclusions) {
+        ASSERT_FALSE(qm::plist::writeFileAtomically(prefs, Value(Dictionary{{"exclusions", Value(std::move(exclusions))}}),
+                                                    qm::plist::Format::binary));
+    };
+    storeExclusions({Value("ovaro.example.notes.share"), Value(Array{})});
+    EXPECT_EQ(identifiers(match(rules)).size(), 1u) << "entries that are no rules dictionaries exclude nothing";
+    storeExclusions({Value(7), Value(Dictionary{{"VTExtensionIdentifier", Value("ovaro.example.notes.share")}})});
     EXPECT_TRUE(identifiers(match(rules)).empty());
     EXPECT_TRUE(qmd->waitForLog("plugin ovaro.example.notes.share excluded"));
 }
