@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -52,9 +53,16 @@ pid_t spawn(std::vector<std::string> argv, std::map<std::string, std::string> ex
     envp.push_back(nullptr);
     constexpr int kFirstHighDescriptor = 100;
     std::vector<int> high(passed.size());  // allocated before fork
+    const pid_t parent = ::getpid();
     pid_t pid = ::fork();
     if (pid == 0) {
         // Only async-signal-safe calls from here on.
+        // A test that crashes takes its daemon with it; a daemon left alive
+        // would hold ctest's output pipe open until the test's timeout.
+        ::prctl(PR_SET_PDEATHSIG, SIGKILL);
+        if (::getppid() != parent) {
+            ::_exit(127);
+        }
         for (int fd = 0; fd < 3; ++fd) {
             if (streams[static_cast<std::size_t>(fd)] >= 0) {
                 ::dup2(streams[static_cast<std::size_t>(fd)], fd);
