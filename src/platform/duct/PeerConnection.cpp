@@ -19,7 +19,6 @@ constexpr std::size_t kMaxReadPerTurn = 256 * 1024;  // then other connections g
 constexpr std::size_t kKeptBufferCapacity = 64 * 1024;
 // A thread's reply buffer keeps no more than this between replies.
 constexpr std::size_t kKeptReplyBufferCapacity = 64 * 1024;
-constexpr std::size_t kMaxFrameSize = kFrameHeaderSize + kMaxPayloadSize;
 
 ucred socketCredentials(int socket) {
     ucred credentials{};
@@ -102,8 +101,8 @@ PeerConnection::PeerConnection(EventLoop& loop, UniqueFd socket, std::optional<P
 
 PeerConnection::~PeerConnection() {
     // Closed connections hold nothing; this is for one its stopped loop dropped unclosed.
-    if (!buffer_.empty()) {
-        budget_->forget(*this, buffer_.size());
+    if (!frames_.empty()) {
+        budget_->forget(*this, frames_.size());
     }
 }
 
@@ -193,20 +192,20 @@ PeerConnection::Wait PeerConnection::receive(bool& hungUp) {
         if (closed_.load() || wait != Wait::none || readThisTurn >= kMaxReadPerTurn) {
             return wait;
         }
-        std::size_t allowance = budget_->receiveAllowance(buffer_.size());
+        std::size_t allowance = budget_->receiveAllowance(frames_.size());
         if (allowance == 0) {
             return Wait::partialBudget;
         }
-        auto room = buffer_.room(bufferCeiling());
+        auto room = frames_.room();
         assert(!room.empty() && "a complete frame is delivered or waited for before reading on");
-        bufferCapacity_.store(buffer_.capacity());
+        bufferCapacity_.store(frames_.capacity());
         std::size_t wanted = std::min({room.size(), allowance, kMaxReadPerTurn - readThisTurn});
         ssize_t n = ::recv(socket_.get(), room.data(), wanted, MSG_DONTWAIT);
         if (n > 0) {
             auto count = static_cast<std::size_t>(n);
-            buffer_.commit(count);
+            frames_.commit(count);
             budget_->chargePartial(shared_from_this(), count);
-            bufferedBytes_.store(buffer_.size());
+            bufferedBytes_.store(frames_.size());
             readThisTurn += count;
             if (count < wanted) {
                 return deliverFrames();  // drained for now; level-triggered epoll calls again if more comes
@@ -220,51 +219,32 @@ PeerConnection::Wait PeerConnection::receive(bool& hungUp) {
     }
 }
 
-// Per connection: at most one maximal frame of received bytes. The storage
-// grows only up to the frame being received, and only as its bytes arrive.
-std::size_t PeerConnection::bufferCeiling() const {
-    if (buffer_.size() < kFrameHeaderSize) {
-        return ReceiveBuffer::kInitialCapacity;
-    }
-    std::size_t frameSize = kFrameHeaderSize + readFrameHeader(buffer_.data()).payloadLength;
-    assert(frameSize <= kMaxFrameSize && "headers are checked before their payload is read");
-    return std::min(frameSize, kMaxFrameSize);
-}
-
 PeerConnection::Wait PeerConnection::deliverFrames() {
     while (!closed_.load()) {
-        if (buffer_.size() < kFrameHeaderSize) {
+        IncomingFrames::Front frame = frames_.front();
+        if (frame.state == IncomingFrames::Front::State::invalid) {
+            closeNow(frame.problem);
             return Wait::none;
         }
-        FrameHeader header = readFrameHeader(buffer_.data());
-        if (header.payloadLength > kMaxPayloadSize) {
-            closeNow(format("frame announces %u bytes, over the 16 MiB limit", header.payloadLength));
-            return Wait::none;
-        }
-        if (header.kind != static_cast<std::uint32_t>(FrameKind::message)) {
-            closeNow(format("frame of kind %u from a client", header.kind));
-            return Wait::none;
-        }
-        std::size_t frameSize = kFrameHeaderSize + header.payloadLength;
-        if (buffer_.size() < frameSize) {
+        if (frame.state == IncomingFrames::Front::State::incomplete) {
             return Wait::none;
         }
         int inFlight = unanswered_.load();
         if (inFlight >= kMaxUnansweredRequests) {
             return Wait::unanswered;
         }
-        if (!budget_->mayDecode(header.payloadLength, inFlight == 0)) {
+        if (!budget_->mayDecode(frame.header.payloadLength, inFlight == 0)) {
             return Wait::decodedBudget;
         }
-        auto decoded = cbor::decodeMeasured({buffer_.data() + kFrameHeaderSize, header.payloadLength});
+        auto decoded = cbor::decodeMeasured(frame.payload);
         if (!decoded) {
             closeNow("invalid payload: " + decoded.error().text());
             return Wait::none;
         }
-        consumeBuffered(frameSize, true);
+        consumeBuffered(frame.frameSize(), true);
         budget_->chargeDecoded(decoded->allocatedBytes);
         unanswered_.fetch_add(1);
-        IncomingMessage message(weak_from_this(), header.messageId, std::move(decoded->value), budget_,
+        IncomingMessage message(weak_from_this(), frame.header.messageId, std::move(decoded->value), budget_,
                                 decoded->allocatedBytes);
         if (handler_) {
             handler_(ConnectionEvent{ConnectionEvent::Kind::message, std::move(message), {}});
@@ -274,13 +254,13 @@ PeerConnection::Wait PeerConnection::deliverFrames() {
 }
 
 void PeerConnection::consumeBuffered(std::size_t count, bool frameCompleted) {
-    buffer_.consume(count);
+    frames_.consume(count);
     budget_->releasePartial(count, frameCompleted);
-    if (buffer_.empty() && buffer_.capacity() > kKeptBufferCapacity) {
-        buffer_.release();
+    if (frames_.empty() && frames_.capacity() > kKeptBufferCapacity) {
+        frames_.release();
     }
-    bufferedBytes_.store(buffer_.size());
-    bufferCapacity_.store(buffer_.capacity());
+    bufferedBytes_.store(frames_.size());
+    bufferCapacity_.store(frames_.capacity());
 }
 
 void PeerConnection::waitFor(Wait wait) {
@@ -450,11 +430,11 @@ void PeerConnection::closeNow(const std::string& reason) {
         handler(ConnectionEvent{ConnectionEvent::Kind::invalid, std::nullopt, reason});
     }
     context_.reset();
-    if (!buffer_.empty()) {
-        consumeBuffered(buffer_.size(), false);
+    if (!frames_.empty()) {
+        consumeBuffered(frames_.size(), false);
     }
     budget_->leave(*this);
-    buffer_.release();
+    frames_.release();
     bufferCapacity_.store(0);
     if (onClosed_) {
         onClosed_();

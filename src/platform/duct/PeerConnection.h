@@ -32,10 +32,10 @@
 #include <optional>
 #include <string>
 
+#include "platform/duct/IncomingFrames.h"
 #include "platform/duct/OpenTransaction.h"
 #include "platform/duct/PeerIdentity.h"
 #include "platform/duct/ReceiveBudget.h"
-#include "platform/duct/ReceiveBuffer.h"
 #include "platform/fd/UniqueFd.h"
 #include "platform/queue/EventLoop.h"
 #include "platform/value/Value.h"
@@ -160,11 +160,10 @@ private:
     void postResumeAfterAnswer();
     Wait receive(bool& hungUp);
     Wait deliverFrames();
-    std::size_t bufferCeiling() const;
     void consumeBuffered(std::size_t count, bool frameCompleted);
     void waitFor(Wait wait);
     void resumeReceiving() override;
-    std::size_t unfinishedBytes() const override { return buffer_.size(); }
+    std::size_t unfinishedBytes() const override { return frames_.size(); }
     void dropStalled(const std::string& reason) override { closeNow(reason); }
     void flushBacklog();
     void updateInterestLocked();
@@ -183,7 +182,7 @@ private:
     // Loop thread only.
     EventHandler handler_;
     std::shared_ptr<void> context_;
-    ReceiveBuffer buffer_;
+    IncomingFrames frames_;
 
     std::atomic<std::size_t> bufferedBytes_{0};
     std::atomic<std::size_t> bufferCapacity_{0};

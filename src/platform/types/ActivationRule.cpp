@@ -44,8 +44,11 @@ bool activationRuleMatches(const Value& rule, const Value& description, const Un
         admitted.push_back({type, *most});
     }
     bool offersSomething = false;
-    for (const auto& [type, value] : *offer) {
-        auto offered = count(value);
+    for (const auto& entry : *offer) {
+        // Named rather than bound: the lambda below takes the type, and not
+        // every compiler lets a lambda capture a structured binding yet.
+        const auto& offeredType = entry.first;
+        auto offered = count(entry.second);
         if (!offered) {
             return false;
         }
@@ -54,7 +57,7 @@ bool activationRuleMatches(const Value& rule, const Value& description, const Un
         }
         offersSomething = true;
         auto takes = [&](const Limit& limit) {
-            return limit.most >= *offered && types.conforms(type, limit.type);
+            return limit.most >= *offered && types.conforms(offeredType, limit.type);
         };
         if (std::none_of(admitted.begin(), admitted.end(), takes)) {
             return false;
