@@ -69,10 +69,11 @@ TEST(Probes, EachFiresWhereItsRequestIsServedWithItsArguments) {
                                ":qmd:plugin__ready { printf(\"%s %s\\n\", probe, str(arg0)); }\n" + "usdt:" + qmd +
                                ":qmd:plugin__remove, usdt:" + qmd +
                                ":qmd:db__load { printf(\"%s %s %d\\n\", probe, str(arg0), arg1); }\n" +
-                               // The README's latency and holds one-liners attach to these two functions.
-                               "uretprobe:" + qmd + ":_ZN11Transaction8dispatchEv { @dispatched = count(); }\n" +
+                               // The README's latency and holds one-liners attach to these two functions;
+                               // function probes fire in every process of the binary, hence cpid.
+                               "uretprobe:" + qmd + ":_ZN11Transaction8dispatchEv /pid == cpid/ { @dispatched = count(); }\n" +
                                "uretprobe:" + qmd + ":_ZN8HoldList7addHoldESt10shared_ptrIK13QMDPlugInHoldE " +
-                               "/retval & 1/ { @holds_taken = count(); }\n";
+                               "/pid == cpid && retval & 1/ { @holds_taken = count(); }\n";
     qmtest::DaemonProcess daemon({}, {{"QM_SYSTEM_ROOTS", dir.file("system")},
                                       {"QM_SDK_PATH", std::string(QM_SOURCE_DIR) + "/examples/SDKs"},
                                       {"XDG_STATE_HOME", dir.file("state")}},
