@@ -58,24 +58,29 @@ for command in $commands; do
 done
 inspect_json=$(part "$qmkit_page" ".SS inspect" ss)
 has_word "$inspect_json" "--json" || fail "qmkit.1 does not describe inspect's own --json"
-global=$(part "$qmkit_page" ".SH OPTIONS")
-for option in $("$build/qmkit" --help | options_in) -h; do
-    has_word "$global" "$option" || fail "qmkit.1 OPTIONS does not describe $option"
-done
-statuses=$(part "$qmkit_page" ".SH EXIT STATUS")
-for status in $("$build/qmkit" --help | sed -n '/^exit status/,$p' | grep -oE '(^|[ ,:])[0-9]+ ' | tr -d ' ,:'); do
-    grep -qx "\.B $status" <<<"$statuses" || fail "qmkit.1 EXIT STATUS does not describe $status"
-done
+# Every word after the page file, named, in a section of the page.
+described() {  # page-file page-name section what word...
+    local text
+    text=$(part "$1" "$3")
+    local name=$2 section=$3 what=$4
+    shift 4
+    for word in "$@"; do
+        if [[ $what == status ]]; then grep -qx "\.B $word" <<<"$text"; else has_word "$text" "$word"; fi ||
+            fail "$name ${section#.SH } does not describe $word"
+    done
+}
+# shellcheck disable=SC2046
+described "$qmkit_page" qmkit.1 ".SH OPTIONS" option $("$build/qmkit" --help | options_in) -h
+# shellcheck disable=SC2046
+described "$qmkit_page" qmkit.1 ".SH EXIT STATUS" status \
+    $("$build/qmkit" --help | sed -n '/^exit status/,$p' | grep -oE '(^|[ ,:])[0-9]+ ' | tr -d ' ,:')
 
 # --- qmd
-global=$(part "$qmd_page" ".SH OPTIONS")
-for option in $("$build/qmd" --help | options_in); do
-    has_word "$global" "$option" || fail "qmd.8 OPTIONS does not describe $option"
-done
-statuses=$(part "$qmd_page" ".SH EXIT STATUS")
-for status in $("$build/qmd" --help | sed -n 's/^Exit status: //p' | grep -oE '(^| )[0-9]+ ' | tr -d ' '); do
-    grep -qx "\.B $status" <<<"$statuses" || fail "qmd.8 EXIT STATUS does not describe $status"
-done
+# shellcheck disable=SC2046
+described "$qmd_page" qmd.8 ".SH OPTIONS" option $("$build/qmd" --help | options_in)
+# shellcheck disable=SC2046
+described "$qmd_page" qmd.8 ".SH EXIT STATUS" status \
+    $("$build/qmd" --help | sed -n 's/^Exit status: //p' | grep -oE '(^| )[0-9]+ ' | tr -d ' ')
 environment=$(part "$qmd_page" ".SH ENVIRONMENT")
 variables=$(grep -oE '(variable|unsetenv)\("[A-Z_]+"\)|"(LANGUAGE|LC_ALL|LC_MESSAGES|LANG)"' \
                 "$top/src/platform/env/Environment.cpp" | grep -oE '[A-Z_]{2,}' | sort -u)
