@@ -12,45 +12,38 @@
 
 namespace {
 
-using qm::Dictionary;
 using qm::Value;
+using D = qm::Dictionary;
 
 TEST(ActivationRule, MatchesWhenEveryOfferedTypeFitsSomeKey) {
     qmtest::TempDir dir;
     qmtest::writeFile(dir.file("mime/subclasses"), "image/png image/x-bitmap\n");
     auto types = qm::UniformTypes::fromMimeDirectories({dir.file("mime")});
     const std::uint64_t huge = std::numeric_limits<std::uint64_t>::max();
-    const Value bitmaps(Dictionary{{"image/x-bitmap", Value(2)}});
+    const D bitmaps{{"image/x-bitmap", 2}};
 
     // {what, rule, offer, matches}
     const std::tuple<const char*, Value, Value, bool> cases[] = {
-        {"parent key", bitmaps, Dictionary{{"image/png", Value(1)}}, true},
-        {"count at the maximum", bitmaps, Dictionary{{"image/png", Value(2)}}, true},
-        {"count over the maximum", bitmaps, Dictionary{{"image/png", Value(3)}}, false},
-        {"lower-cased", bitmaps, Dictionary{{"IMAGE/PNG", Value(1)}}, true},
-        {"no key for the type", bitmaps, Dictionary{{"text/plain", Value(1)}}, false},
-        {"zero count needs no key", bitmaps, Dictionary{{"image/png", Value(1)}, {"text/plain", Value(0)}}, true},
-        {"only zero counts", bitmaps, Dictionary{{"image/png", Value(0)}}, false},
-        {"negative count offers nothing", bitmaps, Dictionary{{"image/png", Value(-1)}}, false},
-        {"empty offer", bitmaps, Dictionary{}, false},
-        {"another key is large enough",
-         Dictionary{{"image/x-bitmap", Value(1)}, {"application/octet-stream", Value(5)}},
-         Dictionary{{"image/png", Value(3)}}, true},
-        {"each type its own key", Dictionary{{"image/x-bitmap", Value(1)}, {"text/plain", Value(1)}},
-         Dictionary{{"image/png", Value(1)}, {"text/x-log", Value(1)}}, true},
-        {"one type of two uncovered", bitmaps, Dictionary{{"image/png", Value(1)}, {"text/x-log", Value(1)}},
-         false},
-        {"unsigned counts", Dictionary{{"image/png", Value(huge)}}, Dictionary{{"image/png", Value(huge - 1)}},
-         true},
-        {"negative maximum", Dictionary{{"image/png", Value(-1)}}, Dictionary{{"image/png", Value(1)}}, false},
-        {"real count", bitmaps, Dictionary{{"image/png", Value(1.0)}}, false},
-        {"Boolean count", bitmaps, Dictionary{{"image/png", Value(true)}}, false},
-        {"unusable count beside a good one", bitmaps,
-         Dictionary{{"image/png", Value(1)}, {"text/plain", Value("0")}}, false},
-        {"string maximum", Dictionary{{"image/png", Value("2")}}, Dictionary{{"image/png", Value(1)}}, false},
-        {"rule not a dictionary", Value(qm::Array{Value("image/png")}), Dictionary{{"image/png", Value(1)}},
-         false},
-        {"offer not a dictionary", bitmaps, Value("image/png"), false},
+        {"parent key", bitmaps, D{{"image/png", 1}}, true},
+        {"count at the maximum", bitmaps, D{{"image/png", 2}}, true},
+        {"count over the maximum", bitmaps, D{{"image/png", 3}}, false},
+        {"lower-cased", bitmaps, D{{"IMAGE/PNG", 1}}, true},
+        {"no key for the type", bitmaps, D{{"text/plain", 1}}, false},
+        {"zero count needs no key", bitmaps, D{{"image/png", 1}, {"text/plain", 0}}, true},
+        {"only zero counts", bitmaps, D{{"image/png", 0}}, false},
+        {"negative count offers nothing", bitmaps, D{{"image/png", -1}}, false},
+        {"empty offer", bitmaps, D{}, false},
+        {"another key is large enough", D{{"image/x-bitmap", 1}, {"application/octet-stream", 5}}, D{{"image/png", 3}}, true},
+        {"each type its own key", D{{"image/x-bitmap", 1}, {"text/plain", 1}}, D{{"image/png", 1}, {"text/x-log", 1}}, true},
+        {"one type of two uncovered", bitmaps, D{{"image/png", 1}, {"text/x-log", 1}}, false},
+        {"unsigned counts", D{{"image/png", huge}}, D{{"image/png", huge - 1}}, true},
+        {"negative maximum", D{{"image/png", -1}}, D{{"image/png", 1}}, false},
+        {"real count", bitmaps, D{{"image/png", 1.0}}, false},
+        {"Boolean count", bitmaps, D{{"image/png", true}}, false},
+        {"unusable count beside a good one", bitmaps, D{{"image/png", 1}, {"text/plain", "0"}}, false},
+        {"string maximum", D{{"image/png", "2"}}, D{{"image/png", 1}}, false},
+        {"rule not a dictionary", qm::Array{"image/png"}, D{{"image/png", 1}}, false},
+        {"offer not a dictionary", bitmaps, "image/png", false},
     };
     for (const auto& [what, rule, offer, matches] : cases) {
         EXPECT_EQ(qm::activationRuleMatches(rule, offer, types), matches) << what;

@@ -5,7 +5,6 @@
 #include <gtest/gtest.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <atomic>
 #include <chrono>
@@ -13,7 +12,7 @@
 #include <functional>
 #include <mutex>
 #include <set>
-#include <thread>
+#include <tuple>
 
 #include "platform/file/PathFacts.h"
 #include "platform/plist/PropertyList.h"
@@ -36,84 +35,72 @@ using Dict = qm::Dictionary;
 // it is a data plug-in.
 Dict plugInInfo(const std::string& identifier, const std::string& point, bool oldStyle = false,
                 bool executable = true) {
-    Dict info{{"MRBundleIdentifier", Value(identifier)}, {"MRBundleName", Value(identifier + " name")}};
+    Dict info{{"MRBundleIdentifier", identifier}, {"MRBundleName", identifier + " name"}};
     if (oldStyle) {
-        info.set("Quamber", Value(Dict{{"Attributes", Value(Dict{{"ovaro.protocol", Value(point)}})}}));
+        info.set("Quamber", Dict{{"Attributes", Dict{{"ovaro.protocol", point}}}});
     } else {
-        info.set("VTExtension", Value(Dict{{"VTExtensionAttributes", Value(Dict{{"VTExtensionPointName", Value(point)}})}}));
+        info.set("VTExtension", Dict{{"VTExtensionAttributes", Dict{{"VTExtensionPointName", point}}}});
     }
     if (executable) {
-        info.set("MRBundleExecutable", Value("run"));
+        info.set("MRBundleExecutable", "run");
     }
     return info;
 }
 
 // Writes Info.plist (desktop style: Contents/Info.plist); returns the bundle.
 std::string writeBundle(const std::string& bundle, const Dict& info, bool desktop = false) {
-    writePlist(bundle + (desktop ? "/Contents/Info.plist" : "/Info.plist"), Value(info));
+    writePlist(bundle + (desktop ? "/Contents/Info.plist" : "/Info.plist"), info);
     return bundle;
-}
-
-std::string resolved(const std::string& path) {
-    auto r = qm::resolvedPath(path);
-    return r ? *r : path;
 }
 
 // Records what it is told; checks that lookups, which never wait for the
 // catalog's thread, already answer for what it is told was installed.
 class Recorder : public qm::AppCatalogObserver {
 public:
+    using Records = std::vector<PlugInRecordPtr>;
     const AppCatalog* catalog = nullptr;
     std::atomic<int> unseen{0};
 
-    void pluginsDidInstall(const std::vector<PlugInRecordPtr>& records) override {
+    void pluginsDidInstall(const Records& records) override {
         for (const auto& record : records) {
             unseen += catalog->plugInWithUuid(record->uuid) == record ? 0 : 1;
         }
         add(installed_, records);
     }
-    void pluginsWillUninstall(const std::vector<PlugInRecordPtr>& records) override { add(uninstalled_, records); }
-    std::vector<PlugInRecordPtr> installed() const { return copy(installed_); }
-    std::vector<PlugInRecordPtr> uninstalled() const { return copy(uninstalled_); }
-    std::set<std::string> installedIdentifiers() const { return identifiers(installed()); }
-    std::set<std::string> uninstalledIdentifiers() const { return identifiers(uninstalled()); }
-    static std::set<std::string> identifiers(const std::vector<PlugInRecordPtr>& records) {
-        std::set<std::string> ids;
-        for (const auto& r : records) {
-            ids.insert(r->identifier);
-        }
-        return ids;
-    }
+    void pluginsWillUninstall(const Records& records) override { add(uninstalled_, records); }
+    Records installed() const { return copy(installed_); }
+    Records uninstalled() const { return copy(uninstalled_); }
 
 private:
-    void add(std::vector<PlugInRecordPtr>& list, const std::vector<PlugInRecordPtr>& records) {
+    void add(Records& list, const Records& records) {
         std::lock_guard lock(mutex_);
         list.insert(list.end(), records.begin(), records.end());
     }
-    std::vector<PlugInRecordPtr> copy(const std::vector<PlugInRecordPtr>& list) const {
+    Records copy(const Records& list) const {
         std::lock_guard lock(mutex_);
         return list;
     }
     mutable std::mutex mutex_;
-    std::vector<PlugInRecordPtr> installed_;
-    std::vector<PlugInRecordPtr> uninstalled_;
+    Records installed_, uninstalled_;
 };
+
+std::set<std::string> identifiers(const Recorder::Records& records) {
+    std::set<std::string> ids;
+    for (const auto& r : records) {
+        ids.insert(r->identifier);
+    }
+    return ids;
+}
 
 // A system root, a user root, a database and a containers folder in one
 // temporary directory; catalogs opened on them with a fresh observer each.
 class AppCatalogTest : public ::testing::Test {
 protected:
-    AppCatalogTest() : base(resolved(dir.path())) {}
+    AppCatalogTest() : base(*qm::resolvedPath(dir.path())) {}
 
     qm::AppCatalogOptions options() const {
-        qm::AppCatalogOptions o;
-        o.databasePath = databasePath;
-        o.systemRoots = {systemRoot, base + "/missing-root"};
-        o.userRoot = userRoot;
-        o.containersDirectory = containers;
-        o.language = "fr";
-        o.lockTimeout = std::chrono::milliseconds(200);
-        return o;
+        return {.databasePath = databasePath, .systemRoots = {systemRoot, base + "/missing-root"}, .userRoot = userRoot,
+                .containersDirectory = containers, .language = "fr", .lockTimeout = std::chrono::milliseconds(200)};
     }
 
     void open(const std::optional<qm::AppCatalogOptions>& given = std::nullopt) {
@@ -155,22 +142,18 @@ protected:
 TEST_F(AppCatalogTest, ScanFindsPlugInsOfBothLayoutsAndEveryMultipleEntry) {
     std::string flatApp = systemRoot + "/Flat.app";
     std::string deskApp = systemRoot + "/Desk.app";
-    writeBundle(flatApp, {{"MRBundleName", Value("Flat")}, {"MRBundleDisplayName", Value("Flat Display")}});
-    writePlist(flatApp + "/fr.lproj/InfoPlist.strings", Value(Dict{{"MRBundleDisplayName", Value("Plat")}}));
+    writeBundle(flatApp, {{"MRBundleName", "Flat"}, {"MRBundleDisplayName", "Flat Display"}});
+    writePlist(flatApp + "/fr.lproj/InfoPlist.strings", Dict{{"MRBundleDisplayName", "Plat"}});
     writeBundle(flatApp + "/PlugIns/New.bundle", plugInInfo("com.new", "point.a"));
-    writePlist(flatApp + "/PlugIns/New.bundle/Entitlements.plist", Value(Dict{{"ent.x", Value(true)}}));
-    writePlist(flatApp + "/PlugIns/New.bundle/fr.lproj/InfoPlist.strings",
-               Value(Dict{{"MRBundleName", Value("Nouveau")}}));
+    writePlist(flatApp + "/PlugIns/New.bundle/Entitlements.plist", Dict{{"ent.x", true}});
+    writePlist(flatApp + "/PlugIns/New.bundle/fr.lproj/InfoPlist.strings", Dict{{"MRBundleName", "Nouveau"}});
     writeBundle(flatApp + "/PlugIns/Data.bundle", plugInInfo("com.data", "point.a", false, false));
-    writeBundle(flatApp + "/PlugIns/Plain.bundle", {{"MRBundleIdentifier", Value("com.plain")}});
+    writeBundle(flatApp + "/PlugIns/Plain.bundle", {{"MRBundleIdentifier", "com.plain"}});
     writeBundle(deskApp + "/Contents/PlugIns/Old.bundle", plugInInfo("com.old", "point.b", true), true);
     Dict multiple = plugInInfo("com.multi.bundle", "point.top");
-    Dict entryOwn{{"VTExtensionAttributes", Value(Dict{{"VTExtensionPointName", Value("point.own")}})}};
-    multiple.set("VTExtension",
-                 Value(multiple.find("VTExtension")
-                           ->asDictionary()
-                           ->changing("Multiple", Value(Dict{{"com.multi.b", Value(entryOwn)},
-                                                             {"com.multi.a", Value(Dict{{"Other", Value(1)}})}}))));
+    Dict entryOwn{{"VTExtensionAttributes", Dict{{"VTExtensionPointName", "point.own"}}}};
+    multiple.set("VTExtension", multiple.find("VTExtension")->asDictionary()->changing(
+                                    "Multiple", Dict{{"com.multi.b", entryOwn}, {"com.multi.a", Dict{{"Other", 1}}}}));
     writeBundle(deskApp + "/Contents/PlugIns/Multi.bundle", multiple, true);
     writeBundle(systemRoot + "/NotAnApp/PlugIns/Lost.bundle", plugInInfo("com.lost", "point.a"));
     writeBundle(userRoot + "/User.app/PlugIns/User.bundle", plugInInfo(".hidden", "point.a"));
@@ -181,12 +164,8 @@ TEST_F(AppCatalogTest, ScanFindsPlugInsOfBothLayoutsAndEveryMultipleEntry) {
     EXPECT_TRUE(log.contains("missing-root")) << log.text();
 
     struct Expected {
-        const char* identifier;
-        const char* bundle;
-        const char* point;
-        const char* application;
-        bool system;
-        bool container;
+        const char *identifier, *bundle, *point, *application;
+        bool system, container;
     };
     const Expected table[] = {
         {"com.new", "/system/Flat.app/PlugIns/New.bundle", "point.a", "/system/Flat.app", true, true},
@@ -209,24 +188,17 @@ TEST_F(AppCatalogTest, ScanFindsPlugInsOfBothLayoutsAndEveryMultipleEntry) {
         EXPECT_EQ(record->containingApplication->path, base + expected.application);
         EXPECT_EQ(record->onSystemVolume, expected.system);
         EXPECT_EQ(record->dataContainerPath.has_value(), expected.container);
-        if (record->dataContainerPath) {
-            EXPECT_TRUE(fs::is_directory(*record->dataContainerPath + "/tmp"));
-        }
         EXPECT_EQ(catalog->plugInWithUuid(record->uuid), record);
-        const Value* url = record->infoDictionary.get("MRBundleInfoPlistURL");
-        ASSERT_TRUE(url && url->isString());
-        EXPECT_TRUE(url->asString()->starts_with("file://" + base));
+        EXPECT_TRUE(qm::stringAt(record->infoDictionary, "MRBundleInfoPlistURL").value_or("").starts_with("file://" + base));
     }
-    EXPECT_TRUE(log.contains("\".hidden\" cannot name")) << log.text();
 
     PlugInRecordPtr fresh = byIdentifier("com.new");
     EXPECT_EQ(fresh->localizedShortName, "Nouveau");
     EXPECT_EQ(fresh->localizedName, "Nouveau");
     EXPECT_EQ(fresh->containingApplication->localizedName, "Plat");
-    EXPECT_EQ(fresh->entitlements, Value(Dict{{"ent.x", Value(true)}}));
+    EXPECT_EQ(fresh->entitlements, Value(Dict{{"ent.x", true}}));
     EXPECT_EQ(fresh->dataContainerPath, containers + "/com.new");
     EXPECT_EQ(byIdentifier("com.multi.b")->plugInDictionary, Value(entryOwn));
-    EXPECT_EQ(byIdentifier("com.old")->infoDictionary.get("Quamber")->isDictionary(), true);
 
     // A bundle with several plug-ins answers the first by identifier.
     EXPECT_EQ(catalog->plugInAtPath(deskApp + "/Contents/PlugIns/Multi.bundle/")->identifier, "com.multi.a");
@@ -245,7 +217,7 @@ TEST_F(AppCatalogTest, ExtensionPointQueryFiltersOnIdentifierAndEntitlements) {
     for (const char* name : {"b", "a", "c"}) {
         std::string bundle = writeBundle(userRoot + "/Q.app/PlugIns/" + name + ".bundle",
                                          plugInInfo(std::string("q.") + name, name == std::string("c") ? "other" : "p"));
-        writePlist(bundle + "/Entitlements.plist", Value(Dict{{"grade", Value(std::string(name))}}));
+        writePlist(bundle + "/Entitlements.plist", Dict{{"grade", name}});
     }
     open();
     struct Case {
@@ -278,7 +250,7 @@ TEST_F(AppCatalogTest, RestartKeepsIdentityAndReadsOnlyWhatChanged) {
     writeBundle(plugIns + "Same.bundle", plugInInfo("r.same", "p"));
     writeBundle(plugIns + "Changed.bundle", plugInInfo("r.changed", "p"));
     std::string entitled = writeBundle(plugIns + "Entitled.bundle", plugInInfo("r.entitled", "p"));
-    writePlist(plugIns + "Same.bundle/de.lproj/InfoPlist.strings", Value(Dict{{"MRBundleName", Value("Gleich")}}));
+    writePlist(plugIns + "Same.bundle/de.lproj/InfoPlist.strings", Dict{{"MRBundleName", "Gleich"}});
     writeBundle(plugIns + "Gone.bundle", plugInInfo("r.gone", "p"));
     std::string outside = writeBundle(base + "/loose/Added.bundle", plugInInfo("r.added", "p"));
     open();
@@ -304,14 +276,14 @@ TEST_F(AppCatalogTest, RestartKeepsIdentityAndReadsOnlyWhatChanged) {
 
     catalog.reset();
     writeBundle(plugIns + "Changed.bundle", plugInInfo("r.changed", "p2"));
-    writePlist(entitled + "/Entitlements.plist", Value(Dict{{"e", Value(true)}}));
+    writePlist(entitled + "/Entitlements.plist", Dict{{"e", true}});
     fs::remove_all(plugIns + "Gone.bundle");
     auto moved = options();
     moved.systemRoots = {base + "/loose"};  // the added bundle now lies on the system volume
     open(moved);
     EXPECT_EQ(catalog->infoFilesParsed(), 2u);
-    EXPECT_EQ(recorder->uninstalledIdentifiers(), (std::set<std::string>{"r.changed", "r.entitled", "r.gone"}));
-    EXPECT_EQ(recorder->installedIdentifiers(), (std::set<std::string>{"r.changed", "r.entitled"}));
+    EXPECT_EQ(identifiers(recorder->uninstalled()), (std::set<std::string>{"r.changed", "r.entitled", "r.gone"}));
+    EXPECT_EQ(identifiers(recorder->installed()), (std::set<std::string>{"r.changed", "r.entitled"}));
     for (const auto& old : before) {
         if (PlugInRecordPtr now = byIdentifier(old->identifier)) {
             bool renewed = old->identifier == "r.changed" || old->identifier == "r.entitled";
@@ -339,7 +311,7 @@ TEST_F(AppCatalogTest, WatchedFoldersShowInstallsUpdatesAndRemovals) {
     ASSERT_TRUE(eventually([&] { return catalog->applicationAtPath(app) != nullptr; }));
     writeBundle(app + "/Contents/PlugIns/Live.bundle", plugInInfo("live.one", "p"), true);
     ASSERT_TRUE(eventually([&] { return byIdentifier("live.one") != nullptr; }));
-    EXPECT_EQ(recorder->installedIdentifiers(), std::set<std::string>{"live.one"});
+    EXPECT_EQ(identifiers(recorder->installed()), std::set<std::string>{"live.one"});
     PlugInRecordPtr first = byIdentifier("live.one");
 
     // An update replaces the bundle: a new registration.
@@ -359,37 +331,31 @@ TEST_F(AppCatalogTest, WatchedFoldersShowInstallsUpdatesAndRemovals) {
 
     fs::remove_all(app);
     ASSERT_TRUE(eventually([&] { return catalog->installedPlugIns().empty(); }));
-    EXPECT_EQ(recorder->uninstalledIdentifiers(), (std::set<std::string>{"live.one", "live.flat"}));
+    EXPECT_EQ(identifiers(recorder->uninstalled()), (std::set<std::string>{"live.one", "live.flat"}));
     EXPECT_FALSE(catalog->applicationAtPath(app));
 }
 
 TEST_F(AppCatalogTest, RegisterAndUnregisterByPath) {
     std::string installed = writeBundle(userRoot + "/In.app/PlugIns/In.bundle", plugInInfo("reg.in", "p"));
     std::string looseApp = base + "/elsewhere/Loose.app";
-    writeBundle(looseApp, {{"MRBundleName", Value("Loose")}});
+    writeBundle(looseApp, {{"MRBundleName", "Loose"}});
     std::string inLooseApp = writeBundle(looseApp + "/Contents/PlugIns/X.bundle", plugInInfo("reg.x", "p"));
     std::string alone = writeBundle(base + "/elsewhere/Alone.bundle", plugInInfo("reg.alone", "p"));
     fs::create_directory_symlink(alone, base + "/link");
-    writeBundle(base + "/elsewhere/Plain.bundle", {{"MRBundleIdentifier", Value("plain")}});
+    writeBundle(base + "/elsewhere/Plain.bundle", {{"MRBundleIdentifier", "plain"}});
     fs::create_directories(base + "/elsewhere/Empty");
     open();
 
     using E = qm::AppCatalogError;
-    struct Refusal {
-        std::string path;
-        E expected;
-    };
-    const Refusal refusals[] = {
-        {base + "/nothing-here", E::notAPlugIn},
-        {base + "/elsewhere/Empty", E::notAPlugIn},
-        {base + "/elsewhere/Plain.bundle", E::notAPlugIn},
-        {looseApp, E::applicationBundle},
+    const std::pair<std::string, E> refusals[] = {
+        {base + "/nothing-here", E::notAPlugIn}, {base + "/elsewhere/Empty", E::notAPlugIn},
+        {base + "/elsewhere/Plain.bundle", E::notAPlugIn}, {looseApp, E::applicationBundle},
         {userRoot + "/In.app", E::applicationBundle},
     };
-    for (const auto& refusal : refusals) {
-        auto error = catalog->registerPlugIn(refusal.path);
-        ASSERT_TRUE(error) << refusal.path;
-        EXPECT_EQ(qm::appCatalogErrorOf(*error), refusal.expected) << refusal.path << ": " << error->text();
+    for (const auto& [path, expected] : refusals) {
+        auto error = catalog->registerPlugIn(path);
+        ASSERT_TRUE(error) << path;
+        EXPECT_EQ(qm::appCatalogErrorOf(*error), expected) << path << ": " << error->text();
     }
     EXPECT_EQ(qm::appCatalogErrorOf(*catalog->unregisterPlugIn(alone)), E::notRegistered);
 
@@ -398,7 +364,7 @@ TEST_F(AppCatalogTest, RegisterAndUnregisterByPath) {
     ASSERT_TRUE(record);
     EXPECT_EQ(record->bundlePath, alone);
     EXPECT_FALSE(record->containingApplication);
-    EXPECT_EQ(recorder->installedIdentifiers(), (std::set<std::string>{"reg.in", "reg.alone"}));
+    EXPECT_EQ(identifiers(recorder->installed()), (std::set<std::string>{"reg.in", "reg.alone"}));
     ASSERT_FALSE(catalog->registerPlugIn(alone));
     EXPECT_EQ(catalog->plugInAtPath(alone)->uuid, record->uuid);
     ASSERT_FALSE(catalog->registerPlugIn(inLooseApp));
@@ -411,7 +377,7 @@ TEST_F(AppCatalogTest, RegisterAndUnregisterByPath) {
     catalog.reset();
     fs::remove_all(inLooseApp);
     open();
-    EXPECT_EQ(recorder->uninstalledIdentifiers(), std::set<std::string>{"reg.x"});
+    EXPECT_EQ(identifiers(recorder->uninstalled()), std::set<std::string>{"reg.x"});
     EXPECT_FALSE(catalog->applicationAtPath(looseApp));
 
     // A registered bundle deleted while the catalog runs is dropped.
@@ -451,7 +417,7 @@ TEST_F(AppCatalogTest, DamagedDatabaseIsMovedAsideAndRebuilt) {
         LogCapture log;
         open();
         EXPECT_TRUE(log.contains("is damaged")) << log.text();
-        EXPECT_EQ(recorder->installedIdentifiers(), std::set<std::string>{"damage.d"});
+        EXPECT_EQ(identifiers(recorder->installed()), std::set<std::string>{"damage.d"});
         std::size_t aside = 0;
         for (const auto& entry : fs::directory_iterator(base + "/data")) {
             aside += entry.path().filename().string().starts_with("AppCatalog.db.bad-") ? 1 : 0;
@@ -475,78 +441,60 @@ TEST_F(AppCatalogTest, SecondOpenerWaitsThenFails) {
 }
 
 TEST(PlugInDeclarations, BothVocabulariesAndTheirFallbacks) {
-    Dict newAttributes{{"VTExtensionIdentifier", Value("n.id")}, {"VTExtensionPointName", Value("n.point")}};
-    Dict oldAttributes{{"ovaro.identifier", Value("o.id")}, {"ovaro.protocol", Value("o.point")}};
-    Dict ownPoint{{"VTExtensionAttributes", Value(Dict{{"VTExtensionPointName", Value("own")}})}};
-    Dict oldOwnPoint{{"Attributes", Value(Dict{{"ovaro.protocol", Value("own")}})}};
+    const Dict newAttributes{{"VTExtensionIdentifier", "n.id"}, {"VTExtensionPointName", "n.point"}};
+    const Dict oldAttributes{{"ovaro.identifier", "o.id"}, {"ovaro.protocol", "o.point"}};
+    const Dict ownPoint{{"VTExtensionAttributes", Dict{{"VTExtensionPointName", "own"}}}};
+    const Dict oldOwnPoint{{"Attributes", Dict{{"ovaro.protocol", "own"}}}};
     auto info = [](const char* top, Dict topDictionary) {
-        return Value(Dict{{"MRBundleIdentifier", Value("bundle.id")}, {top, Value(std::move(topDictionary))}});
+        return Dict{{"MRBundleIdentifier", "bundle.id"}, {top, std::move(topDictionary)}};
     };
-    struct Case {
-        const char* name;
-        Value info;
-        std::vector<std::pair<std::string, std::optional<std::string>>> expected;  // identifier, point
-    };
-    const Case cases[] = {
-        {"new style", info("VTExtension", {{"VTExtensionAttributes", Value(newAttributes)}}), {{"n.id", "n.point"}}},
-        {"old style", info("Quamber", {{"Attributes", Value(oldAttributes)}}), {{"o.id", "o.point"}}},
-        {"old keys in a new top are not read", info("VTExtension", {{"Attributes", Value(oldAttributes)}}),
-         {{"bundle.id", std::nullopt}}},
+    using Declared = std::vector<std::pair<std::string, std::optional<std::string>>>;  // identifier, point
+    const std::tuple<const char*, Value, Declared> cases[] = {
+        {"new style", info("VTExtension", {{"VTExtensionAttributes", newAttributes}}), {{"n.id", "n.point"}}},
+        {"old style", info("Quamber", {{"Attributes", oldAttributes}}), {{"o.id", "o.point"}}},
+        {"old keys in a new top are not read", info("VTExtension", {{"Attributes", oldAttributes}}), {{"bundle.id", {}}}},
         {"both: the new one wins",
-         Value(info("Quamber", {{"Attributes", Value(oldAttributes)}})
-                   .asDictionary()
-                   ->changing("VTExtension", Value(Dict{{"VTExtensionAttributes", Value(newAttributes)}}))),
+         info("Quamber", {{"Attributes", oldAttributes}}).changing("VTExtension", Dict{{"VTExtensionAttributes", newAttributes}}),
          {{"n.id", "n.point"}}},
         {"multiple, new style",
-         info("VTExtension", {{"VTExtensionAttributes", Value(newAttributes)},
-                              {"Multiple", Value(Dict{{"m.2", Value(ownPoint)}, {"m.1", Value(Dict{})}})}}),
+         info("VTExtension", {{"VTExtensionAttributes", newAttributes}, {"Multiple", Dict{{"m.2", ownPoint}, {"m.1", Dict{}}}}}),
          {{"m.1", "n.point"}, {"m.2", "own"}}},
-        {"multiple, old style",
-         info("Quamber", {{"Attributes", Value(oldAttributes)}, {"Multiple", Value(Dict{{"m.1", Value(oldOwnPoint)}})}}),
+        {"multiple, old style", info("Quamber", {{"Attributes", oldAttributes}, {"Multiple", Dict{{"m.1", oldOwnPoint}}}}),
          {{"m.1", "own"}}},
-        {"multiple that is no dictionary", info("VTExtension", {{"Multiple", Value("x")}}), {{"bundle.id", std::nullopt}}},
-        {"top that is no dictionary", Value(Dict{{"MRBundleIdentifier", Value("b")}, {"VTExtension", Value(3)}}),
-         {{"b", std::nullopt}}},
-        {"nothing identifies it", Value(Dict{{"VTExtension", Value(Dict{})}}), {}},
-        {"no plug-in at all", Value(Dict{{"MRBundleIdentifier", Value("b")}}), {}},
+        {"multiple that is no dictionary", info("VTExtension", {{"Multiple", "x"}}), {{"bundle.id", {}}}},
+        {"top that is no dictionary", Dict{{"MRBundleIdentifier", "b"}, {"VTExtension", 3}}, {{"b", {}}}},
+        {"nothing identifies it", Dict{{"VTExtension", Dict{}}}, {}},
+        {"no plug-in at all", Dict{{"MRBundleIdentifier", "b"}}, {}},
     };
-    for (const auto& c : cases) {
-        std::vector<std::pair<std::string, std::optional<std::string>>> got;
-        for (const auto& declared : qm::declaredPlugIns(c.info)) {
+    for (const auto& [name, declaring, expected] : cases) {
+        Declared got;
+        for (const auto& declared : qm::declaredPlugIns(declaring)) {
             got.emplace_back(declared.identifier, declared.extensionPoint);
         }
-        EXPECT_EQ(got, c.expected) << c.name;
+        EXPECT_EQ(got, expected) << name;
     }
 }
 
 TEST(DataContainer, NamedByTheBundleIdentifierForCodePlugInsOnly) {
     qmtest::TempDir dir;
-    const std::string containers = dir.file("Containers");
-    struct Case {
-        std::optional<std::string> identifier;
-        bool executable;
-        bool made;
+    // {identifier, names an executable, a container is made}
+    const std::tuple<std::optional<std::string>, bool, bool> cases[] = {
+        {"com.ok", true, true}, {"com.ok", false, false}, {"", true, false},       {"a/b", true, false},
+        {".hidden", true, false}, {"..", true, false},    {std::nullopt, true, false},
     };
-    const Case cases[] = {
-        {"com.ok", true, true},   {"com.ok", false, false}, {"", true, false},
-        {"a/b", true, false},     {".hidden", true, false}, {"..", true, false},
-        {std::nullopt, true, false},
-    };
-    for (const auto& c : cases) {
+    for (const auto& [identifier, executable, made] : cases) {
         Dict info;
-        if (c.identifier) {
-            info.set("MRBundleIdentifier", Value(*c.identifier));
+        if (identifier) {
+            info.set("MRBundleIdentifier", *identifier);
         }
-        if (c.executable) {
-            info.set("MRBundleExecutable", Value("run"));
+        if (executable) {
+            info.set("MRBundleExecutable", "run");
         }
         LogCapture log;
-        auto container = qm::makeDataContainer(containers, Value(info), "/b");
-        EXPECT_EQ(container.has_value(), c.made) << c.identifier.value_or("(none)");
-        EXPECT_EQ(log.lines().size(), c.made || !c.executable ? 0u : 1u) << log.text();
-        if (container) {
-            EXPECT_TRUE(fs::is_directory(*container + "/tmp"));
-        }
+        auto container = qm::makeDataContainer(dir.file("Containers"), info, "/b");
+        EXPECT_EQ(container.has_value(), made) << identifier.value_or("(none)");
+        EXPECT_EQ(log.lines().size(), made || !executable ? 0u : 1u) << log.text();
+        EXPECT_TRUE(!container || fs::is_directory(*container + "/tmp"));
     }
 }
 
@@ -561,7 +509,7 @@ TEST_F(AppCatalogTest, BundlesThatCannotBeStoredAreRefusedAlone) {
     fs::copy(odd, userRoot + "/S.app/PlugIns/Odd.bundle", fs::copy_options::recursive);
     writeBundle(userRoot + "/S.app/PlugIns/Fine.bundle", plugInInfo("fine", "p"));
     open();
-    EXPECT_EQ(recorder->installedIdentifiers(), std::set<std::string>{"fine"});
+    EXPECT_EQ(identifiers(recorder->installed()), std::set<std::string>{"fine"});
     auto error = catalog->registerPlugIn(odd);
     ASSERT_TRUE(error);
     EXPECT_EQ(qm::appCatalogErrorOf(*error), qm::AppCatalogError::notAPlugIn);
@@ -570,7 +518,7 @@ TEST_F(AppCatalogTest, BundlesThatCannotBeStoredAreRefusedAlone) {
 
 TEST_F(AppCatalogTest, UntrustedEntitlementsAreLoggedOncePerRegistration) {
     std::string bundle = writeBundle(userRoot + "/T.app/PlugIns/T.bundle", plugInInfo("t", "p"));
-    writePlist(bundle + "/Entitlements.plist", Value(Dict{{"e", Value(true)}}));
+    writePlist(bundle + "/Entitlements.plist", Dict{{"e", true}});
     ASSERT_EQ(::chmod((bundle + "/Entitlements.plist").c_str(), 0666), 0);
     LogCapture log;
     open();

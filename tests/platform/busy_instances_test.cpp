@@ -7,7 +7,6 @@
 #include <filesystem>
 
 #include "platform/file/PathFacts.h"
-#include "platform/plist/PropertyList.h"
 #include "platform/wardend/BusyInstances.h"
 #include "support/ChildProcess.h"
 #include "support/TempDir.h"
@@ -33,18 +32,12 @@ protected:
     std::string ext = "com.example.ext." + std::to_string(::getpid());
     std::string host = "com.example.host." + std::to_string(::getpid());
 
-    // A bundle at root/<path> whose Info is `info`; its executable, a copy of
-    // /bin/sleep, at <info folder>/<executable> (flat) or Contents/Exec/ (desktop).
-    std::string makeBundle(const std::string& path, const qm::Dictionary& info, const std::string& executable,
-                           bool desktop = false) {
-        std::string bundle = root + "/" + path;
-        std::string infoFolder = desktop ? bundle + "/Contents" : bundle;
-        std::filesystem::create_directories(infoFolder);
-        EXPECT_FALSE(qm::plist::writeFileAtomically(infoFolder + "/Info.plist", qm::Value(info), qm::plist::Format::xml));
-        std::string program = (desktop ? infoFolder + "/Exec/" : infoFolder + "/") + executable;
-        std::filesystem::create_directories(std::filesystem::path(program).parent_path());
-        std::filesystem::copy_file("/bin/sleep", program);
-        return program;
+    // A bundle at root/<path> whose Info is `info`, and beside that Info its
+    // executable, a copy of /bin/sleep.
+    std::string makeBundle(const std::string& path, const qm::Dictionary& info, const std::string& executable) {
+        qmtest::writePlist(root + "/" + path + "/Info.plist", info);
+        std::filesystem::copy_file("/bin/sleep", root + "/" + path + "/" + executable);
+        return root + "/" + path + "/" + executable;
     }
 
     qm::Dictionary plugInInfo(const std::string& identifier, const std::string& executable = "Ext") {
@@ -58,36 +51,25 @@ protected:
     }
 };
 
+// Which file /proc names and which bundle lies around it is
+// BundleDirectory's to tell, for either layout: one layout is enough here.
 TEST_F(BusyInstances, ARunningPlugInIsBusyUntilItIsKilled) {
-    for (bool desktop : {false, true}) {
-        SCOPED_TRACE(desktop ? "desktop style" : "flat");
-        std::string name = desktop ? "Desk.app/Contents/PlugIns/Ext.xbun" : "Flat.app/PlugIns/Ext.xbun";
-        std::string program = makeBundle(name, plugInInfo(ext), "Ext", desktop);
-        qmtest::ChildProcess first(program, "60");
-        qmtest::ChildProcess second(program, "60");
-        ASSERT_GT(first.pid(), 0);
-        ASSERT_GT(second.pid(), 0);
-        std::vector<BusyInstance> both = {{first.pid(), ext}, {second.pid(), ext}};
-        std::sort(both.begin(), both.end(), [](const auto& a, const auto& b) { return a.pid < b.pid; });
-        EXPECT_EQ(busy({ext, "com.example.other"}), both);
-        EXPECT_EQ(busy({"com.example.other"}), std::vector<BusyInstance>{});
-        EXPECT_EQ(busy({}), std::vector<BusyInstance>{});
-
-        first.kill();  // a zombie until reaped: no longer running the plug-in
-        second.kill();
-        EXPECT_EQ(busy({ext}), std::vector<BusyInstance>{});
-    }
+    std::string program = makeBundle("Flat.app/PlugIns/Ext.xbun", plugInInfo(ext), "Ext");
+    qmtest::ChildProcess first(program, "60");
+    qmtest::ChildProcess second(program, "60");
+    ASSERT_GT(first.pid(), 0);
+    ASSERT_GT(second.pid(), 0);
+    std::vector<BusyInstance> both = {{first.pid(), ext}, {second.pid(), ext}};
+    std::sort(both.begin(), both.end(), [](const auto& a, const auto& b) { return a.pid < b.pid; });
+    EXPECT_EQ(busy({ext, "com.example.other"}), both);
+    EXPECT_EQ(busy({"com.example.other"}), std::vector<BusyInstance>{});
+    first.kill();  // a zombie until reaped: no longer running the plug-in
+    second.kill();
+    EXPECT_EQ(busy({ext}), std::vector<BusyInstance>{});
 }
 
-TEST_F(BusyInstances, AnApplicationsOwnProcessLeavesItsPlugInsIdle) {
-    std::string application = makeBundle(
-        "Host.app", {{"MRBundleIdentifier", host}, {"MRBundleExecutable", "Host"}}, "Host");
-    makeBundle("Host.app/PlugIns/Ext.xbun", plugInInfo(ext), "Ext");
-    qmtest::ChildProcess running(application, "60");
-    ASSERT_GT(running.pid(), 0);
-    EXPECT_EQ(busy({ext, host}), std::vector<BusyInstance>{});
-}
-
+// Each bundle holds an idle plug-in of the asked identifier, so an
+// application's own process (the "not a plug-in" case) is seen to leave it idle.
 TEST_F(BusyInstances, ProcessesOfNoIdentifiablePlugInAreNotBusy) {
     struct Case {
         const char* name;
@@ -96,15 +78,16 @@ TEST_F(BusyInstances, ProcessesOfNoIdentifiablePlugInAreNotBusy) {
     } cases[] = {
         {"no identifier", {{"MRBundleExecutable", "Ext"}, {"VTExtension", kPlugInDeclaration}}, "Ext"},
         {"empty identifier", plugInInfo(""), "Ext"},
-        {"not a plug-in", {{"MRBundleIdentifier", ext}, {"MRBundleExecutable", "Ext"}}, "Ext"},
+        {"not a plug-in", {{"MRBundleIdentifier", host}, {"MRBundleExecutable", "Host"}}, "Host"},
         {"not the bundle's executable", plugInInfo(ext, "Other"), "Ext"},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
-        std::string program = makeBundle(std::string(c.name) + ".xbun", c.info, c.running);
+        std::string program = makeBundle(std::string(c.name) + ".app", c.info, c.running);
+        makeBundle(std::string(c.name) + ".app/PlugIns/Ext.xbun", plugInInfo(ext), "Ext");
         qmtest::ChildProcess child(program, "60");
         ASSERT_GT(child.pid(), 0);
-        EXPECT_EQ(busy({ext, ""}), std::vector<BusyInstance>{});
+        EXPECT_EQ(busy({ext, host, ""}), std::vector<BusyInstance>{});
     }
 
     std::string damaged = makeBundle("Damaged.xbun", plugInInfo(ext), "Ext");

@@ -34,24 +34,12 @@ void* allocate(std::size_t size) {
 }
 }  // namespace
 
-void* operator new(std::size_t size) {
-    return allocate(size);
-}
-void* operator new[](std::size_t size) {
-    return allocate(size);
-}
-void operator delete(void* p) noexcept {
-    std::free(p);
-}
-void operator delete[](void* p) noexcept {
-    std::free(p);
-}
-void operator delete(void* p, std::size_t) noexcept {
-    std::free(p);
-}
-void operator delete[](void* p, std::size_t) noexcept {
-    std::free(p);
-}
+void* operator new(std::size_t size) { return allocate(size); }
+void* operator new[](std::size_t size) { return allocate(size); }
+void operator delete(void* p) noexcept { std::free(p); }
+void operator delete[](void* p) noexcept { std::free(p); }
+void operator delete(void* p, std::size_t) noexcept { std::free(p); }
+void operator delete[](void* p, std::size_t) noexcept { std::free(p); }
 
 namespace qm {
 namespace {
@@ -83,20 +71,14 @@ std::string repeated(std::string_view hexByte, std::size_t count) {
     return out;
 }
 
-// Why the decoder refused the payload.
-std::string refusal(std::string_view hexText) {
+// Why the decoder refused the payload; "read whole" when it read all of it,
+// every level included: written again, it is the payload itself.
+std::string refusal(const std::string& hexText) {
     auto result = cbor::decode(hexBytes(hexText));
-    if (result.ok()) {
-        return "accepted: " + result->description();
+    if (!result.ok()) {
+        return result.error().domain == "cbor" ? result.error().text() : "in domain " + result.error().domain;
     }
-    return result.error().domain == "cbor" ? result.error().text() : "in domain " + result.error().domain;
-}
-
-// The payload as the decoder read it, written again: the payload itself
-// when all of it was read, every level included.
-std::string reencoded(const std::string& hexText) {
-    auto result = cbor::decode(hexBytes(hexText));
-    return result.ok() ? hex(cbor::encode(*result)) : result.error().text();
+    return hex(cbor::encode(*result)) == hexText ? "read whole" : "accepted: " + result->description();
 }
 
 // n nested arrays, the innermost empty; tag 24 around content.
@@ -250,31 +232,26 @@ TEST(CborDecode, InvalidPayloadsAreRefusedWithTheirReason) {
 }
 
 // Every array, map and tag is a level, the content of tag 24 included;
-// scalars are not.
+// scalars are not. Hostile depths are refused without exhausting the stack.
 TEST(CborDecode, NestingOf512LevelsIsAcceptedAnd513Refused) {
-    EXPECT_EQ(reencoded(nestedArrays(512)), nestedArrays(512));
-    EXPECT_EQ(refusal(nestedArrays(513)), tooDeep);
-    std::string mapsThenDate = repeated("81", 510) + "a1616bc100";
-    EXPECT_EQ(reencoded(mapsThenDate), mapsThenDate);
-    EXPECT_EQ(refusal("81" + mapsThenDate), tooDeep);
-    EXPECT_EQ(refusal(repeated("81", 512) + "d825" + kUuidHex), tooDeep);
-    EXPECT_EQ(refusal(repeated("81", 512) + "a0"), tooDeep);  // even an empty one
-    EXPECT_EQ(reencoded(repeated("81", 512) + "00"), repeated("81", 512) + "00");
-
-    // 255 arrays, the tag at level 256, then 256 more levels inside: 512.
-    std::string tagAt256 = repeated("81", 255) + packedTag(nestedArrays(256));
-    EXPECT_EQ(reencoded(tagAt256), tagAt256);
-    EXPECT_EQ(refusal(repeated("81", 255) + packedTag(nestedArrays(257))), tooDeep);
-    std::string inner = nestedArrays(509);  // packed inside packed keeps counting
-    EXPECT_EQ(reencoded("81" + packedTag(packedTag(inner))), "81" + packedTag(packedTag(inner)));
-    EXPECT_EQ(refusal("8181" + packedTag(packedTag(inner))), tooDeep);
-}
-
-TEST(CborDecode, HostileDepthIsRefusedWithoutExhaustingTheStack) {
-    EXPECT_EQ(refusal(repeated("81", 100000) + "80"), tooDeep);
-    EXPECT_EQ(refusal(repeated("a1616b", 100000) + "a0"), tooDeep);
-    EXPECT_EQ(refusal(repeated("c1", 100000) + "00"), "tag 1 content is not a number");
-    EXPECT_EQ(refusal(repeated("9f", 100000)), "indefinite length");
+    const std::string whole = "read whole";
+    const std::string mapsThenDate = repeated("81", 510) + "a1616bc100";
+    const std::string inner = nestedArrays(509);  // packed inside packed keeps counting
+    const std::pair<std::string, std::string> cases[] = {
+        {nestedArrays(512), whole}, {nestedArrays(513), tooDeep}, {mapsThenDate, whole}, {"81" + mapsThenDate, tooDeep},
+        {repeated("81", 512) + "d825" + kUuidHex, tooDeep},
+        {repeated("81", 512) + "a0", tooDeep},  // even an empty one
+        {repeated("81", 512) + "00", whole},
+        // 255 arrays, the tag at level 256, then 256 more levels inside: 512.
+        {repeated("81", 255) + packedTag(nestedArrays(256)), whole},
+        {repeated("81", 255) + packedTag(nestedArrays(257)), tooDeep},
+        {"81" + packedTag(packedTag(inner)), whole}, {"8181" + packedTag(packedTag(inner)), tooDeep},
+        {repeated("81", 100000) + "80", tooDeep}, {repeated("a1616b", 100000) + "a0", tooDeep},
+        {repeated("c1", 100000) + "00", "tag 1 content is not a number"}, {repeated("9f", 100000), "indefinite length"},
+    };
+    for (const auto& [payload, reason] : cases) {
+        EXPECT_EQ(refusal(payload), reason) << payload.substr(0, 40) << "... of " << payload.size() / 2 << " bytes";
+    }
     Value deep;  // encoding needs no recursion either
     for (int i = 0; i < 2000; ++i) {
         deep = Value(Array{deep});

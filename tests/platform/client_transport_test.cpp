@@ -52,6 +52,9 @@ struct Pair {
     std::optional<FramePeer> peer;
 };
 
+// Most tests need one pair.
+class ClientTransport : public ::testing::Test, protected Pair {};
+
 void expectInvalidity(const qm::Result<Value>& reply, const std::string& fragment) {
     ASSERT_FALSE(reply.ok());
     EXPECT_EQ(reply.error().domain, "duct");
@@ -61,69 +64,67 @@ void expectInvalidity(const qm::Result<Value>& reply, const std::string& fragmen
 
 // Messages that cannot be sent are refused, and nothing of them reaches the
 // peer; replies then reach their own handlers on the queue.
-TEST(ClientTransport, RepliesReachTheirOwnHandlersOnTheQueueWhateverTheirOrder) {
-    Pair pair;
-    pair.client->send(Value("not a dictionary"), pair.outcomes.handler(-1));
-    pair.client->send(Value(qm::Dictionary{{"d", Value(qm::Bytes(qm::duct::kMaxPayloadSize, 0))}}), pair.outcomes.handler(-2));
-    ASSERT_TRUE(pair.outcomes.waitForReplies(2));
+TEST_F(ClientTransport, RepliesReachTheirOwnHandlersOnTheQueueWhateverTheirOrder) {
+    client->send(Value("not a dictionary"), outcomes.handler(-1));
+    client->send(Value(qm::Dictionary{{"d", Value(qm::Bytes(qm::duct::kMaxPayloadSize, 0))}}), outcomes.handler(-2));
+    ASSERT_TRUE(outcomes.waitForReplies(2));
     for (const auto& [tag, code, text] : {std::tuple{-1, EINVAL, "not a dictionary"}, std::tuple{-2, EMSGSIZE, "16 MiB"}}) {
-        auto refused = pair.outcomes.reply(tag);
+        auto refused = outcomes.reply(tag);
         ASSERT_FALSE(refused.ok());
         EXPECT_EQ(refused.error().domain, "duct");
         EXPECT_EQ(refused.error().code, code);
         EXPECT_NE(refused.error().text().find(text), std::string::npos) << refused.error().text();
     }
-    qmtest::Frame first = pair.sendAndRead(1);
-    qmtest::Frame second = pair.sendAndRead(2);
+    qmtest::Frame first = sendAndRead(1);
+    qmtest::Frame second = sendAndRead(2);
     EXPECT_EQ(first.kind, 1u);
     EXPECT_EQ(first.body, message(1));
     EXPECT_EQ(second.body, message(2));
-    EXPECT_EQ(pair.client->pendingCount(), 2u);
-    pair.peer->reply(second.id, Value(qm::Dictionary{{"answer", 2}}));
-    pair.peer->reply(first.id, Value(qm::Array{Value(1), Value("one")}));  // not a dictionary: delivered as it is
-    ASSERT_TRUE(pair.outcomes.waitForReplies(4));
-    EXPECT_EQ(pair.outcomes.order(), (std::vector<int>{-1, -2, 2, 1}));
-    EXPECT_EQ(*pair.outcomes.reply(1), Value(qm::Array{Value(1), Value("one")}));
-    EXPECT_EQ(*pair.outcomes.reply(2), Value(qm::Dictionary{{"answer", 2}}));
-    EXPECT_TRUE(pair.outcomes.ranOnTheirQueues());
-    EXPECT_TRUE(pair.client->isValid());
-    EXPECT_EQ(pair.client->pendingCount(), 0u);
-    EXPECT_TRUE(pair.outcomes.events().empty());
+    EXPECT_EQ(client->pendingCount(), 2u);
+    peer->reply(second.id, Value(qm::Dictionary{{"answer", 2}}));
+    peer->reply(first.id, Value(qm::Array{Value(1), Value("one")}));  // not a dictionary: delivered as it is
+    ASSERT_TRUE(outcomes.waitForReplies(4));
+    EXPECT_EQ(outcomes.order(), (std::vector<int>{-1, -2, 2, 1}));
+    EXPECT_EQ(*outcomes.reply(1), Value(qm::Array{Value(1), Value("one")}));
+    EXPECT_EQ(*outcomes.reply(2), Value(qm::Dictionary{{"answer", 2}}));
+    EXPECT_TRUE(outcomes.ranOnTheirQueues());
+    EXPECT_TRUE(client->isValid());
+    EXPECT_EQ(client->pendingCount(), 0u);
+    EXPECT_TRUE(outcomes.events().empty());
 }
 
-TEST(ClientTransport, ConcurrentSendersGetUniqueIdsAndTheirOwnReplies) {
-    Pair pair;
+TEST_F(ClientTransport, ConcurrentSendersGetUniqueIdsAndTheirOwnReplies) {
     constexpr int kThreads = 4;
     constexpr int kPerThread = 50;
     std::set<std::uint64_t> ids;
     {
         std::jthread echo([&] {
             for (int i = 0; i < kThreads * kPerThread; ++i) {
-                auto frame = pair.peer->receive();
+                auto frame = peer->receive();
                 ASSERT_TRUE(frame);
                 ids.insert(frame->id);
-                pair.peer->reply(frame->id, frame->body);  // echoes the message as its reply
+                peer->reply(frame->id, frame->body);  // echoes the message as its reply
             }
         });
         std::vector<std::jthread> senders;
         for (int t = 0; t < kThreads; ++t) {
             senders.emplace_back([&, t] {
                 for (int n = t * kPerThread; n < (t + 1) * kPerThread; ++n) {
-                    pair.client->send(message(n), pair.outcomes.handler(n));
+                    client->send(message(n), outcomes.handler(n));
                 }
             });
         }
     }
-    ASSERT_TRUE(pair.outcomes.waitForReplies(kThreads * kPerThread));
+    ASSERT_TRUE(outcomes.waitForReplies(kThreads * kPerThread));
     EXPECT_EQ(ids.size(), static_cast<std::size_t>(kThreads * kPerThread));
     for (int n = 0; n < kThreads * kPerThread; ++n) {
-        EXPECT_EQ(pair.outcomes.value(n), message(n));
+        EXPECT_EQ(outcomes.value(n), message(n));
     }
 }
 
 // Whatever ends the connection fails every pending request and every later
 // send with its reason, and tells the event handler once.
-TEST(ClientTransport, WhatEndsTheConnectionFailsEveryRequestWithItsReason) {
+TEST_F(ClientTransport, WhatEndsTheConnectionFailsEveryRequestWithItsReason) {
     using Ending = std::function<void(Pair&, std::uint64_t lastId)>;
     const std::pair<Ending, const char*> cases[] = {
         {[](Pair& p, std::uint64_t) { p.peer->close(); }, "daemon closed the connection"},
@@ -137,7 +138,7 @@ TEST(ClientTransport, WhatEndsTheConnectionFailsEveryRequestWithItsReason) {
     };
     for (const auto& [end, reason] : cases) {
         SCOPED_TRACE(reason);
-        Pair pair;
+        Pair pair;  // one of its own for each ending
         pair.sendAndRead(1);
         end(pair, pair.sendAndRead(2).id);
         ASSERT_TRUE(pair.outcomes.waitForReplies(2));
@@ -154,47 +155,40 @@ TEST(ClientTransport, WhatEndsTheConnectionFailsEveryRequestWithItsReason) {
     }
 }
 
-TEST(ClientTransport, AReplyOfExactlyTheLimitIsAccepted) {
-    Pair pair;
-    qmtest::Frame frame = pair.sendAndRead(1);
+TEST_F(ClientTransport, AReplyOfExactlyTheLimitIsAccepted) {
+    qmtest::Frame frame = sendAndRead(1);
     // {"d": h'...'}: map head 1, key 2, byte-string head 5 bytes, then the data.
     Value big(qm::Dictionary{{"d", Value(qm::Bytes(qm::duct::kMaxPayloadSize - 8, 0x5a))}});
     ASSERT_EQ(qm::cbor::encode(big).size(), qm::duct::kMaxPayloadSize);
-    std::thread writer([&] { pair.peer->reply(frame.id, big); });
-    ASSERT_TRUE(pair.outcomes.waitForReplies(1, 30s));
+    std::thread writer([&] { peer->reply(frame.id, big); });
+    ASSERT_TRUE(outcomes.waitForReplies(1, 30s));
     writer.join();
-    EXPECT_EQ(pair.outcomes.value(1), big);
-    EXPECT_TRUE(pair.client->isValid());
+    EXPECT_EQ(outcomes.value(1), big);
+    EXPECT_TRUE(client->isValid());
 }
 
-TEST(ClientTransport, DestructionFailsPendingRequestsWithoutAnEvent) {
-    Pair pair;
-    pair.client->send(message(1), pair.outcomes.handler(1));
-    pair.client->send(message(2), pair.outcomes.handler(2));
-    pair.client.reset();  // the peer is still open: the reader must be woken
-    ASSERT_TRUE(pair.outcomes.waitForReplies(2));
-    expectInvalidity(pair.outcomes.reply(1), "connection closed by the client");
-    expectInvalidity(pair.outcomes.reply(2), "connection closed by the client");
+TEST_F(ClientTransport, DestructionFailsPendingRequestsWithoutAnEvent) {
+    client->send(message(1), outcomes.handler(1));
+    client->send(message(2), outcomes.handler(2));
+    client.reset();  // the peer is still open: the reader must be woken
+    ASSERT_TRUE(outcomes.waitForReplies(2));
+    expectInvalidity(outcomes.reply(1), "connection closed by the client");
+    expectInvalidity(outcomes.reply(2), "connection closed by the client");
     std::this_thread::sleep_for(50ms);
-    EXPECT_TRUE(pair.outcomes.events().empty());
+    EXPECT_TRUE(outcomes.events().empty());
 }
 
-TEST(ClientTransport, ServicesAreFoundByNameInTheRuntimeDirectory) {
+TEST_F(ClientTransport, ServicesAreFoundByNameInTheRuntimeDirectory) {
     qmtest::TempDir scratch;
     qmtest::ScopedEnvironment ductDirectory("QM_DUCT_DIR", scratch.path());
     qm::UniqueFd listener = FramePeer::listenAt(scratch.file("test.service"));
-    qmtest::ReplyCollector outcomes;
-    qm::SerialQueue queue("test-by-name");
-    auto client = ClientConnection::connect("test.service", queue, outcomes.eventHandler(), ClientConnection::Options{2000ms});
-    ASSERT_TRUE(client.ok()) << client.error().text();
-    FramePeer peer = FramePeer::accept(listener);
-    (*client)->send(message(7), outcomes.handler(7));
-    auto frame = peer.receive();
+    auto named = ClientConnection::connect("test.service", queue, outcomes.eventHandler(), ClientConnection::Options{2000ms});
+    ASSERT_TRUE(named.ok()) << named.error().text();
+    FramePeer accepted = FramePeer::accept(listener);
+    (*named)->send(message(7), outcomes.handler(7));
+    auto frame = accepted.receive();
     ASSERT_TRUE(frame);
     EXPECT_EQ(frame->body, message(7));
-    peer.reply(frame->id, Value(qm::Dictionary{{"ok", true}}));
-    ASSERT_TRUE(outcomes.waitForReplies(1));
-    EXPECT_EQ(*outcomes.reply(7), Value(qm::Dictionary{{"ok", true}}));
 
     auto missing = ClientConnection::connect("nobody.here", queue, nullptr);
     ASSERT_FALSE(missing.ok());

@@ -8,6 +8,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstdlib>
+#include <filesystem>
 #include <fstream>
 #include <optional>
 #include <string>
@@ -38,8 +39,7 @@ Names sortedEntries(const std::string& folder) {
 // Runtime directories live on tmpfs, as $XDG_RUNTIME_DIR does, where a
 // rename costs microseconds rather than a journal entry.
 std::optional<std::string> memoryBackedTemporaries() {
-    struct stat status {};
-    if (::stat("/dev/shm", &status) == 0 && S_ISDIR(status.st_mode)) {
+    if (std::filesystem::is_directory("/dev/shm")) {
         return "/dev/shm";
     }
     const char* current = std::getenv("TMPDIR");
@@ -90,8 +90,7 @@ TEST_F(NotificationsTest, APostIsInItsFileWhenItReturnsUntilAResetStartsAgain) {
     ASSERT_EQ(::chmod(dir_.file("notify").c_str(), 0755), 0);
 
     ASSERT_FALSE(poster_.reset());
-    struct stat status {};
-    EXPECT_TRUE(::stat(dir_.file("notify").c_str(), &status) == 0 && (status.st_mode & 07777) == 0700u);
+    EXPECT_EQ(static_cast<unsigned>(std::filesystem::status(dir_.file("notify")).permissions()), 0700u);
     EXPECT_TRUE(sortedEntries(dir_.file("notify")).empty());
     EXPECT_EQ(poster_.count("other"), 0u);
     ASSERT_FALSE(poster_.post("other"));

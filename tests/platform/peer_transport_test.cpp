@@ -7,6 +7,7 @@
 
 #include <gtest/gtest.h>
 
+#include <numeric>
 #include <tuple>
 
 #include "platform/duct/Frame.h"
@@ -235,9 +236,7 @@ TEST_F(DuctTransport, ALargeReplyReachesASlowReaderWhole) {
     client.send(numbered(1));
     ASSERT_TRUE(server.waitForMessages(1));
     qm::Bytes blob(3 * 1024 * 1024);
-    for (std::size_t i = 0; i < blob.size(); ++i) {
-        blob[i] = static_cast<std::uint8_t>(i * 7);
-    }
+    std::iota(blob.begin(), blob.end(), std::uint8_t{0});  // not all one byte, so misplaced data shows
     qm::Value big(qm::Dictionary{{"blob", qm::Value(blob)}});
     EXPECT_EQ(server.takeMessage().reply(big), ReplyResult::sent);  // returns at once: the rest waits in the backlog
     auto reply = client.receive(std::chrono::seconds(20));
@@ -282,7 +281,6 @@ TEST_F(DuctTransport, BrokenFramesCloseOnlyTheirOwnConnection) {
         {qmtest::rawFrame("\xa0", 2), "frame of kind 2 from a client"},
         {qmtest::rawFrame("\xa0", 7), "frame of kind 7 from a client"},
         {qmtest::rawFrame("\xa1\x61k"), "invalid payload: truncated item"},
-        {qmtest::rawFrame(std::string(100000, '\x81') + "\x80"), "invalid payload: nesting deeper than 512 levels"},
     };
     int number = 0;
     for (const auto& [bytes, reason] : cases) {
