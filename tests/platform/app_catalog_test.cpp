@@ -6,8 +6,10 @@
 #include <sqlite3.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <cmath>
 #include <filesystem>
 #include <functional>
 #include <mutex>
@@ -270,8 +272,8 @@ TEST_F(AppCatalogTest, RestartKeepsIdentityAndReadsOnlyWhatChanged) {
     for (std::size_t i = 0; i < after.size(); ++i) {
         EXPECT_EQ(after[i]->uuid, before[i]->uuid);
         EXPECT_EQ(after[i]->registrationDate, before[i]->registrationDate);
-        EXPECT_EQ(after[i]->registrationDate.secondsSince1970,
-                  static_cast<double>(static_cast<std::int64_t>(after[i]->registrationDate.secondsSince1970)));
+        double seconds = after[i]->registrationDate.secondsSince1970;
+        EXPECT_EQ(std::trunc(seconds), seconds) << "stored in whole seconds";
     }
 
     catalog.reset();
@@ -418,11 +420,8 @@ TEST_F(AppCatalogTest, DamagedDatabaseIsMovedAsideAndRebuilt) {
         open();
         EXPECT_TRUE(log.contains("is damaged")) << log.text();
         EXPECT_EQ(identifiers(recorder->installed()), std::set<std::string>{"damage.d"});
-        std::size_t aside = 0;
-        for (const auto& entry : fs::directory_iterator(base + "/data")) {
-            aside += entry.path().filename().string().starts_with("AppCatalog.db.bad-") ? 1 : 0;
-        }
-        EXPECT_GE(aside, 1u);
+        auto isAside = [](const fs::directory_entry& e) { return e.path().filename().string().starts_with("AppCatalog.db.bad-"); };
+        EXPECT_GE(std::count_if(fs::directory_iterator(base + "/data"), fs::directory_iterator(), isAside), 1);
         PlugInRecordPtr record = byIdentifier("damage.d");
         open();  // the rebuilt file is sound and keeps the identity
         EXPECT_EQ(byIdentifier("damage.d")->uuid, record->uuid);

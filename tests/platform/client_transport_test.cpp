@@ -94,8 +94,7 @@ TEST_F(ClientTransport, RepliesReachTheirOwnHandlersOnTheQueueWhateverTheirOrder
 }
 
 TEST_F(ClientTransport, ConcurrentSendersGetUniqueIdsAndTheirOwnReplies) {
-    constexpr int kThreads = 4;
-    constexpr int kPerThread = 50;
+    constexpr int kThreads = 4, kPerThread = 50;
     std::set<std::uint64_t> ids;
     {
         std::jthread echo([&] {

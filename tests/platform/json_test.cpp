@@ -88,13 +88,11 @@ TEST(Json, ParsesValuesWithTheirTypes) {
 }
 
 TEST(Json, RefusalsSayWhatAndWhere) {
-    const std::string deepObjects = [] {
-        std::string text;
-        for (int i = 0; i < 513; ++i) {
-            text += "{\"k\":";
-        }
-        return text + "1" + std::string(513, '}');
-    }();
+    std::string deepObjects;
+    for (int i = 0; i < 513; ++i) {
+        deepObjects += "{\"k\":";
+    }
+    deepObjects += "1" + std::string(513, '}');
     // {text, a part of the message, how the message ends}
     std::vector<std::tuple<std::string, std::string, std::string>> cases = {
         {"", "unexpected end of input", "line 1, column 1"},
