@@ -22,20 +22,14 @@ using qmtest::request;
 
 namespace {
 
-// Each kind of broken frame is the transport's test; here one makes the
-// whole trip: its connection is closed and logged, the daemon serves on. A
-// flood that is never read goes on until its replies outgrow the backlog
-// bound and the daemon cuts the flooder off rather than hold them; nobody
-// else waits for it meanwhile.
-TEST(Connections, BrokenAndFloodingClientsCostOnlyTheirOwnConnection) {
+// Each way a connection breaks is the transport's test; here one makes the
+// whole trip: a flood that is never read goes on until its replies outgrow
+// the backlog bound and the daemon cuts the flooder off rather than hold
+// them, logs why and serves on; nobody else waits for it meanwhile.
+TEST(Connections, AFloodingClientCostsOnlyItsOwnConnection) {
     DaemonProcess daemon;
     FramePeer bystander(daemon.socketPath());
     ASSERT_TRUE(bystander.roundTrip(bulk()));
-    FramePeer attacker(daemon.socketPath());
-    ASSERT_TRUE(attacker.sendBytes(qmtest::frameHeader(16 * 1024 * 1024 + 1, 1, 1)));
-    EXPECT_TRUE(attacker.waitForClose());
-    EXPECT_TRUE(daemon.waitForLog("connection closed: frame announces 16777217 bytes"));
-    EXPECT_TRUE(bystander.roundTrip(bulk()));
 
     FramePeer flooder(daemon.socketPath());
     auto one = qm::duct::encodeFrame(qm::duct::FrameKind::message, 1, request({{"request", "nope"}, {"version", 3u}}));
@@ -63,7 +57,7 @@ TEST(Connections, BrokenAndFloodingClientsCostOnlyTheirOwnConnection) {
         ASSERT_TRUE(FramePeer(daemon.socketPath()).roundTrip(bulk(), std::chrono::seconds(10))) << "round " << i;
     }
     EXPECT_TRUE(qmtest::eventually([&] { return cutOff.load(); }, std::chrono::seconds(30)));
-    EXPECT_TRUE(daemon.waitForLog("reply backlog over 4 MiB"));
+    EXPECT_TRUE(daemon.waitForLog("connection closed: reply backlog over 4 MiB"));
     ASSERT_TRUE(daemon.running());
     EXPECT_TRUE(bystander.roundTrip(bulk()));
 }

@@ -1,6 +1,8 @@
 // A real qmd over a catalog of the example applications: "match" with its
 // filters and explanations, "annotate" and its notification, "add" and
-// "remove", and installs seen while it runs.
+// "remove", holds, and what hosts get to launch plug-ins. How rules match,
+// elections filter and the catalog follows installs are the unit tests'
+// business; here each takes its path through the daemon.
 
 #include <gtest/gtest.h>
 
@@ -11,12 +13,10 @@
 #include <set>
 
 #include "platform/plist/PropertyList.h"
-#include "platform/sandbox/ReadExtensions.h"
 #include "support/ChildProcess.h"
 #include "support/DaemonProcess.h"
 #include "support/Eventually.h"
 #include "support/FramePeer.h"
-#include "support/ScopedEnvironment.h"
 
 namespace {
 
@@ -30,31 +30,28 @@ namespace fs = std::filesystem;
 
 class Discovery : public ::testing::Test {
 protected:
-    Discovery()
-        : qmd(std::make_unique<qmtest::DaemonProcess>(std::vector<std::string>{"-v"}, qmtest::exampleApplications(roots))),
-          client(std::make_unique<qmtest::FramePeer>(qmd->socketPath())) {}
-    Value send(std::initializer_list<Dictionary::Entry> entries) {
-        Dictionary request(entries);
-        request.set("version", Value(std::uint64_t{3}));
-        auto reply = client->roundTrip(Value(std::move(request)));
-        EXPECT_TRUE(reply);
-        return reply.value_or(Value());
-    }
     Value match(Dictionary rules, std::uint64_t flags = 0, bool explain = false) {
-        return send({{"request", Value("match")}, {"rules", Value(std::move(rules))}, {"flags", Value(flags)},
-                     {"explain", Value(explain)}});
+        return client.ask({{"request", Value("match")}, {"rules", Value(std::move(rules))}, {"flags", Value(flags)},
+                           {"explain", Value(explain)}});
+    }
+    Value hold(qmtest::FramePeer& peer, std::uint64_t flags, Array paths) {
+        return peer.ask({{"request", Value("lock")}, {"flags", Value(flags)}, {"paths", Value(std::move(paths))}});
+    }
+    static const Array& forms(const Value& reply, const char* key = "matches") {
+        static const Array none;
+        const Value* packed = reply.get(key);
+        const Value* list = packed ? packed->packedContent() : nullptr;
+        return list && list->asArray() ? *list->asArray() : none;
     }
     static std::vector<std::string> identifiers(const Value& reply, const char* key = "matches") {
         std::vector<std::string> found;
-        const Value* packed = reply.get(key);
-        const Value* forms = packed ? packed->packedContent() : nullptr;
-        for (const Value& form : forms && forms->asArray() ? *forms->asArray() : Array{}) {
+        for (const Value& form : forms(reply, key)) {
             found.push_back(*form.get("identifier")->asString());
         }
         return found;
     }
     static const Value* form(const Value& reply, const std::string& identifier) {
-        for (const Value& form : *reply.get("matches")->packedContent()->asArray()) {
+        for (const Value& form : forms(reply)) {
             if (*form.get("identifier")->asString() == identifier) {
                 return &form;
             }
@@ -67,94 +64,76 @@ protected:
         const Value* found = form(reply, identifier);
         return found ? Value(*qm::Uuid::parse(*found->get("uuid")->asString())) : Value();
     }
+    static void changeInfo(const std::string& bundle, const char* key, Value value) {
+        auto info = qm::plist::readFile(bundle + "/Info.plist");
+        ASSERT_TRUE(info);
+        qmtest::writePlist(bundle + "/Info.plist", Value(info->asDictionary()->changing(key, std::move(value))));
+    }
 
     qmtest::TempDir roots;
-    std::unique_ptr<qmtest::DaemonProcess> qmd;
-    std::unique_ptr<qmtest::FramePeer> client;
+    qmtest::DaemonProcess qmd{{"-v"}, qmtest::exampleApplications(roots)};
+    qmtest::FramePeer client{qmd.socketPath()};
+    const std::string notes = roots.file("system/Notes.app");
+    const std::string share = notes + "/PlugIns/ShareToNotes.bundle";
+    const Dictionary shareServices{{"VTExtensionPointName", Value("ovaro.share-services")}};
 };
 
 TEST_F(Discovery, RulesSelectAmongTheInstalledPlugInsInPathOrder) {
-    struct Case {
-        const char* name;
-        Dictionary rules;
-        std::vector<std::string> expected;
+    const std::pair<Dictionary, std::vector<std::string>> cases[] = {
+        {shareServices, {"ovaro.example.notes.share"}},
+        // An operator leaves no extension point to narrow the search by.
+        {{{"VTExtensionPointName", Value(">ovaro.share-services")}}, {"ovaro.example.notes.widget"}},
+        // Two plug-ins of one multiplexed bundle.
+        {{{"VTExtensionPointName", Value("ovaro.image-filter")}}, {"ovaro.example.studio.blur", "ovaro.example.studio.sharpen"}},
     };
-    const Case cases[] = {
-        {"one extension point", {{"VTExtensionPointName", Value("ovaro.share-services")}}, {"ovaro.example.notes.share"}},
-        {"with the election filter", {{"VTExtensionPointName", Value("ovaro.share-services")}, {"VTUserElection", Value("1")}}, {}},
-        {"an operator falls back to every plug-in",
-         {{"VTExtensionPointName", Value(">ovaro.share-services")}},
-         {"ovaro.example.notes.widget"}},
-        {"two plug-ins of one multiplexed bundle",
-         {{"VTExtensionPointName", Value("ovaro.image-filter")}},
-         {"ovaro.example.studio.blur", "ovaro.example.studio.sharpen"}},
-    };
-    for (const Case& c : cases) {
-        EXPECT_EQ(identifiers(match(c.rules)), c.expected) << c.name;
+    for (const auto& [rules, expected] : cases) {
+        EXPECT_EQ(identifiers(match(rules)), expected) << Value(rules).description();
     }
-    EXPECT_EQ(errorCode(send({{"request", Value("match")}, {"rules", Value("x")}})), 4u);
-    auto v2 = client->roundTrip(qmtest::request({{"request", Value("match")}, {"version", Value(std::uint64_t{2})}}));
-    ASSERT_TRUE(v2);
-    EXPECT_EQ(*v2, Value(Dictionary{})) << "version 2 has no matches";
+    EXPECT_EQ(errorCode(client.ask({{"request", Value("match")}, {"rules", Value("x")}})), 4u);
+    EXPECT_EQ(client.ask({{"request", Value("match")}, {"version", Value(std::uint64_t{2})}}), Value(Dictionary{}))
+        << "version 2 has no matches";
     EXPECT_EQ(errorText(match({}, 0x200)), "unauthorized discovery flag (QMDiscoverAll)");
 }
 
 TEST_F(Discovery, ExplanationsSayWhyEachCandidateWasLeftOut) {
     Value reply = match({{"VTExtensionPointName", Value(">a")}, {"Category", Value("notes")}}, 0, true);
-    const Value* packed = reply.get("explanations");
-    ASSERT_TRUE(packed && packed->packedContent()) << reply.description();
     std::map<std::string, std::pair<std::string, std::string>> why;
-    for (const Value& entry : *packed->packedContent()->asArray()) {
+    for (const Value& entry : forms(reply, "explanations")) {
         why[*entry.get("identifier")->asString()] = {*entry.get("step")->asString(), *entry.get("detail")->asString()};
     }
-    EXPECT_EQ(why["ovaro.example.notes.widget"], std::make_pair(std::string("rules"), std::string("Category")));
+    EXPECT_EQ(why["ovaro.example.notes.widget"], std::make_pair(std::string("rules"), std::string("Category")))
+        << reply.description();
     EXPECT_EQ(why["ovaro.example.studio.passproxy"].first, "misconfigured");
     EXPECT_FALSE(why.contains("ovaro.example.notes.share")) << "offered, so not explained";
     EXPECT_EQ(identifiers(reply), std::vector<std::string>{"ovaro.example.notes.share"});
 }
 
 TEST_F(Discovery, AnElectionIsStoredAnnouncedAndSelectable) {
-    Value before = match({{"VTExtensionPointName", Value("ovaro.share-services")}});
-    ASSERT_TRUE(form(before, "ovaro.example.notes.share"));
     Value uuid = uuidOf("ovaro.example.notes.share");
-    EXPECT_EQ(*form(before, "ovaro.example.notes.share")->get("annotations"), Value(Dictionary{}));
-
-    struct Case {
-        Dictionary annotations;
-        std::optional<std::string> error;
+    auto annotate = [&](Dictionary annotations) {
+        return client.ask({{"request", Value("annotate")}, {"uuids", Value(Array{uuid})}, {"annotations", Value(std::move(annotations))}});
     };
-    const Case refused[] = {
-        {{{"election", Value("1")}}, "invalid request format (annotation election)"},
-        {{{"extension", Value(1)}}, "invalid request format (annotation extension)"},
-    };
-    for (const Case& c : refused) {
-        EXPECT_EQ(errorText(send({{"request", Value("annotate")}, {"uuids", Value(Array{uuid})}, {"annotations", Value(c.annotations)}})),
-                  *c.error);
+    ASSERT_TRUE(form(match(shareServices), "ovaro.example.notes.share"));
+    EXPECT_EQ(*form(match(shareServices), "ovaro.example.notes.share")->get("annotations"), Value(Dictionary{}));
+    // An election is a number, an extension a dictionary.
+    for (const auto& [key, wrong] : {std::pair{"election", Value("1")}, std::pair{"extension", Value(1)}}) {
+        EXPECT_EQ(errorText(annotate({{key, wrong}})), std::string("invalid request format (annotation ") + key + ")");
     }
-    EXPECT_EQ(send({{"request", Value("annotate")}, {"annotations", Value(Dictionary{{"other", Value(1)}})}}),
+    EXPECT_EQ(client.ask({{"request", Value("annotate")}, {"annotations", Value(Dictionary{{"other", Value(1)}})}}),
               Value(Dictionary{})) << "nothing to store: the uuids are not read";
-    Value annotated = send({{"request", Value("annotate")},
-                            {"uuids", Value(Array{uuid})},
-                            {"annotations", Value(Dictionary{{"election", Value(1)}})}});
-    EXPECT_EQ(annotated, Value(Dictionary{}));
+    EXPECT_EQ(annotate({{"election", Value(1)}}), Value(Dictionary{}));
     // Posted before the reply.
-    EXPECT_EQ(qmtest::readFile(qmd->runtimeDirectory() + "/notify/ovaro.quamber.annotation-change"), "1");
-    Value elected = match({{"VTExtensionPointName", Value("ovaro.share-services")}, {"VTUserElection", Value("1")}});
+    EXPECT_EQ(qmtest::readFile(qmd.runtimeDirectory() + "/notify/ovaro.quamber.annotation-change"), "1");
+    Value elected = match(shareServices.changing("VTUserElection", Value("1")));
     ASSERT_TRUE(form(elected, "ovaro.example.notes.share"));
     EXPECT_EQ(*form(elected, "ovaro.example.notes.share")->get("annotations"), Value(Dictionary{{"election", Value(1)}}));
 }
 
 TEST_F(Discovery, AddAndRemoveRegisterByPathAndRefuseWhatIsNoPlugIn) {
-    std::string outside = roots.file("outside/Extra.bundle");
+    const std::string outside = roots.file("outside/Extra.bundle");
     fs::create_directories(roots.file("outside"));
-    fs::copy(roots.file("system/Notes.app/PlugIns/Spelling.bundle"), outside, fs::copy_options::recursive);
-    std::string extraInfo = outside + "/Info.plist";
-    auto info = qm::plist::readFile(extraInfo);
-    ASSERT_TRUE(info);
-    qm::Dictionary changed = *info->asDictionary();
-    changed.set("MRBundleIdentifier", Value("ovaro.example.extra"));
-    ASSERT_FALSE(qm::plist::writeFileAtomically(extraInfo, Value(changed), qm::plist::Format::xml));
-
+    fs::copy(notes + "/PlugIns/Spelling.bundle", outside, fs::copy_options::recursive);
+    changeInfo(outside, "MRBundleIdentifier", Value("ovaro.example.extra"));
     struct Case {
         const char* request;
         std::string path;
@@ -164,59 +143,36 @@ TEST_F(Discovery, AddAndRemoveRegisterByPathAndRefuseWhatIsNoPlugIn) {
     const Case cases[] = {
         {"add", "relative/path", 9, "absolute path required: relative/path"},
         {"add", roots.file("missing"), 9, "invalid plugin path: " + roots.file("missing")},
-        {"add", roots.file("system/Notes.app"), 9, "invalid plugin path: " + roots.file("system/Notes.app")},
+        {"add", notes, 9, "invalid plugin path: " + notes},
         {"add", roots.file("outside"), 2, "unable to register plug-in at " + roots.file("outside")},
         {"add", outside, std::nullopt, ""},
         {"remove", outside, std::nullopt, ""},
         {"remove", outside, 9, "no plugin at " + outside},
     };
     for (const Case& c : cases) {
-        Value reply = send({{"request", Value(c.request)}, {"paths", Value(Array{Value(c.path)})}});
+        Value reply = client.ask({{"request", Value(c.request)}, {"paths", Value(Array{Value(c.path)})}});
         EXPECT_EQ(errorCode(reply), c.code) << c.request << " " << c.path;
         EXPECT_EQ(errorText(reply), c.error) << c.request << " " << c.path;
     }
-    EXPECT_TRUE(qmd->waitForLog("INSTALLED:ovaro.example.extra"));
-    EXPECT_TRUE(qmd->waitForLog("UNINSTALLED:ovaro.example.extra"));
-}
-
-TEST_F(Discovery, ApplicationsInstalledAndRemovedWhileRunningAreSeen) {
-    Dictionary rules{{"VTExtensionPointName", Value("ovaro.widget")}};
-    ASSERT_EQ(identifiers(match(rules)), std::vector<std::string>{"ovaro.example.notes.widget"});
-    fs::rename(roots.file("system/Notes.app"), roots.file("Notes.app"));
-    EXPECT_TRUE(qmd->waitForLog("UNINSTALLED:ovaro.example.notes.widget")) << qmd->log();
-    EXPECT_TRUE(identifiers(match(rules)).empty());
-    fs::rename(roots.file("Notes.app"), roots.file("system/Notes.app"));
-    // Seen again, under a new UUID.
-    std::string uuidBefore = *form(match({}), "ovaro.example.studio.blur")->get("uuid")->asString();
-    EXPECT_TRUE(qmtest::eventually([&] { return !identifiers(match(rules)).empty(); }));
-    EXPECT_EQ(identifiers(match(rules)), std::vector<std::string>{"ovaro.example.notes.widget"});
-    EXPECT_EQ(*form(match({}), "ovaro.example.studio.blur")->get("uuid")->asString(), uuidBefore)
-        << "an untouched application keeps its plug-ins' UUIDs";
+    EXPECT_TRUE(qmd.waitForLog("INSTALLED:ovaro.example.extra"));
+    EXPECT_TRUE(qmd.waitForLog("UNINSTALLED:ovaro.example.extra"));
 }
 
 // A second application carries ShareToNotes again, one version up, and a
 // plug-in that replaces it.
 TEST_F(Discovery, DuplicatesResolveByVersionAndReplacementsAreMarked) {
-    std::string copy = roots.file("Copy.app");
-    fs::copy(roots.file("system/Notes.app"), copy, fs::copy_options::recursive);
-    auto setVersion = [](const std::string& info, const char* version) {
-        auto dictionary = qm::plist::readFile(info);
-        ASSERT_TRUE(dictionary);
-        ASSERT_FALSE(qm::plist::writeFileAtomically(
-            info, Value(dictionary->asDictionary()->changing("MRBundleVersion", Value(version))), qm::plist::Format::xml));
-    };
-    setVersion(copy + "/PlugIns/ShareToNotes.bundle/Info.plist", "3.10");
-    std::string replacing = copy + "/PlugIns/Spelling.bundle";
-    qmtest::writeFile(replacing + "/Entitlements.plist",
+    const std::string copy = roots.file("Copy.app");
+    fs::copy(notes, copy, fs::copy_options::recursive);
+    changeInfo(copy + "/PlugIns/ShareToNotes.bundle", "MRBundleVersion", Value("3.10"));
+    qmtest::writeFile(copy + "/PlugIns/Spelling.bundle/Entitlements.plist",
                       R"(<plist version="1.0"><dict><key>ovaro.developer.replace-plugin</key>)"
                       R"(<string>ovaro.example.notes.share</string></dict></plist>)");
     fs::rename(copy, roots.file("system/Copy.app"));
 
-    Dictionary shares{{"VTExtensionIdentifier", Value("ovaro.example.notes.share")}};
     auto versionsOf = [&](std::uint64_t flags) {
         std::multiset<std::string> versions;
-        Value reply = match(shares, flags);
-        for (const Value& found : *reply.get("matches")->packedContent()->asArray()) {
+        const Value reply = match({{"VTExtensionIdentifier", Value("ovaro.example.notes.share")}}, flags);
+        for (const Value& found : forms(reply)) {
             versions.insert(*found.get("version")->asString());
         }
         return versions;
@@ -227,10 +183,8 @@ TEST_F(Discovery, DuplicatesResolveByVersionAndReplacementsAreMarked) {
 
     Value both = match({{"VTExtensionIdentifier", Value(Array{Value("ovaro.example.notes.share"), Value("ovaro.example.notes.spelling")})}});
     const Value* replacer = nullptr;
-    for (const Value& found : *both.get("matches")->packedContent()->asArray()) {
-        if (*found.get("path")->asString() == roots.file("system/Copy.app/PlugIns/Spelling.bundle")) {
-            replacer = &found;
-        }
+    for (const Value& found : forms(both)) {
+        replacer = *found.get("path")->asString() == roots.file("system/Copy.app/PlugIns/Spelling.bundle") ? &found : replacer;
     }
     ASSERT_TRUE(replacer) << both.description();
     EXPECT_EQ(*replacer->get("overriding"), Value("ovaro.example.notes.share"));
@@ -240,113 +194,88 @@ TEST_F(Discovery, DuplicatesResolveByVersionAndReplacementsAreMarked) {
 }
 
 TEST_F(Discovery, TheUsersExclusionsAreReadAgainWhenTheyChange) {
-    Dictionary rules{{"VTExtensionPointName", Value("ovaro.share-services")}};
-    ASSERT_EQ(identifiers(match(rules)).size(), 1u);
-    std::string prefs = qmd->scratchPath("config/ovaro/ovaro.quamber.userprefs.plist");
-    fs::create_directories(fs::path(prefs).parent_path());
+    ASSERT_EQ(identifiers(match(shareServices)).size(), 1u);
+    const std::string prefs = qmd.scratchPath("config/ovaro/ovaro.quamber.userprefs.plist");
     auto storeExclusions = [&](Array exclusions) {
-        ASSERT_FALSE(qm::plist::writeFileAtomically(prefs, Value(Dictionary{{"exclusions", Value(std::move(exclusions))}}),
-                                                    qm::plist::Format::binary));
+        qmtest::writePlist(prefs, Value(Dictionary{{"exclusions", Value(std::move(exclusions))}}), qm::plist::Format::binary);
     };
     storeExclusions({Value("ovaro.example.notes.share"), Value(Array{})});
-    EXPECT_EQ(identifiers(match(rules)).size(), 1u) << "entries that are no rules dictionaries exclude nothing";
+    EXPECT_EQ(identifiers(match(shareServices)).size(), 1u) << "entries that are no rules dictionaries exclude nothing";
     storeExclusions({Value(7), Value(Dictionary{{"VTExtensionIdentifier", Value("ovaro.example.notes.share")}})});
-    EXPECT_TRUE(identifiers(match(rules)).empty());
-    EXPECT_TRUE(qmd->waitForLog("plugin ovaro.example.notes.share excluded"));
+    EXPECT_TRUE(identifiers(match(shareServices)).empty());
+    EXPECT_TRUE(qmd.waitForLog("plugin ovaro.example.notes.share excluded"));
 }
 
+// How holds are kept and dropped is the hold list's test; here the requests,
+// the listing and a holder's death as the daemon sees them.
 TEST_F(Discovery, AHoldHidesItsPlugInsUntilReleasedOrItsClientDies) {
-    std::string share = roots.file("system/Notes.app/PlugIns/ShareToNotes.bundle");
-    Dictionary rules{{"VTExtensionPointName", Value("ovaro.share-services")}};
-    auto lock = [&](qmtest::FramePeer& peer, std::uint64_t flags, Array paths) {
-        auto reply = peer.roundTrip(qmtest::request({{"request", Value("lock")}, {"version", Value(std::uint64_t{3})},
-                                                     {"flags", Value(flags)}, {"paths", Value(std::move(paths))}}));
-        return reply.value_or(Value());
-    };
-    EXPECT_EQ(errorText(lock(*client, 3, Array{Value(share)})), "invalid request format (unsupported hold flags)");
-    EXPECT_TRUE(lock(*client, 3, Array{}).get("uuids")) << "no path: an empty hold";
-    EXPECT_EQ(errorText(lock(*client, 2, Array{Value(roots.file("system/Notes.app"))})),
-              "no plug-in at path:" + roots.file("system/Notes.app"));
+    const std::vector<std::string> offered{"ovaro.example.notes.share"};
+    EXPECT_EQ(errorText(hold(client, 3, {Value(share)})), "invalid request format (unsupported hold flags)");
+    EXPECT_TRUE(hold(client, 3, {}).get("uuids")) << "no path: an empty hold";
+    EXPECT_EQ(errorText(hold(client, 2, {Value(notes)})), "no plug-in at path:" + notes);
 
-    Value granted = lock(*client, 2, Array{Value(share)});
+    Value granted = hold(client, 2, {Value(share)});
     ASSERT_TRUE(granted.get("uuids") && granted.get("uuids")->asUuid()) << granted.description();
-    Value token = *granted.get("uuids");
-    EXPECT_TRUE(identifiers(match(rules)).empty());
-    EXPECT_EQ(identifiers(match(rules, 0, true), "explanations"), std::vector<std::string>{"ovaro.example.notes.share"});
-    Value holds = send({{"request", Value("holds")}});
+    const Value token = *granted.get("uuids");
+    EXPECT_TRUE(identifiers(match(shareServices)).empty());
+    EXPECT_EQ(identifiers(match(shareServices, 0, true), "explanations"), offered);
+    Value holds = client.ask({{"request", Value("holds")}});
     ASSERT_EQ(holds.get("holds")->asArray()->size(), 2u) << holds.description();
     EXPECT_EQ(*(*holds.get("holds")->asArray())[1].get("uuid"), token);
     EXPECT_EQ(*(*holds.get("holds")->asArray())[1].get("pid"), Value(static_cast<std::int64_t>(::getpid())));
 
     // Any client may release by token; a second release changes nothing.
-    qmtest::FramePeer other(qmd->socketPath());
+    qmtest::FramePeer other(qmd.socketPath());
     for (int i = 0; i < 2; ++i) {
-        EXPECT_EQ(other.roundTrip(qmtest::request({{"request", Value("lock")}, {"version", Value(std::uint64_t{3})},
-                                                   {"uuids", Value(Array{token})}})),
-                  Value(Dictionary{}));
+        EXPECT_EQ(other.ask({{"request", Value("lock")}, {"uuids", Value(Array{token})}}), Value(Dictionary{}));
     }
-    EXPECT_EQ(identifiers(match(rules)), std::vector<std::string>{"ovaro.example.notes.share"});
+    EXPECT_EQ(identifiers(match(shareServices)), offered);
 
-    // A holder that dies leaves no hold behind.
     {
-        qmtest::FramePeer installer(qmd->socketPath());
-        ASSERT_TRUE(lock(installer, 1, Array{Value(roots.file("system/Notes.app"))}).get("uuids"));
-        EXPECT_TRUE(identifiers(match(rules)).empty());
+        qmtest::FramePeer installer(qmd.socketPath());
+        ASSERT_TRUE(hold(installer, 1, {Value(notes)}).get("uuids"));
+        EXPECT_TRUE(identifiers(match(shareServices)).empty());
     }
-    EXPECT_TRUE(qmd->waitForLog("for dead client pid"));
-    EXPECT_EQ(identifiers(match(rules)), std::vector<std::string>{"ovaro.example.notes.share"});
+    EXPECT_TRUE(qmd.waitForLog("for dead client pid"));
+    EXPECT_EQ(identifiers(match(shareServices)), offered) << "a holder that died left its hold";
 }
 
 TEST_F(Discovery, AnApplicationWithABusyPlugInCannotBeHeld) {
-    std::string bundle = roots.file("system/Notes.app/PlugIns/ShareToNotes.bundle");
-    fs::copy_file("/bin/sleep", bundle + "/ShareToNotes", fs::copy_options::overwrite_existing);
-    auto holdNotes = [&] {
-        return send({{"request", Value("lock")}, {"flags", Value(std::uint64_t{1})},
-                     {"paths", Value(Array{Value(roots.file("system/Notes.app"))})}});
-    };
-    qmtest::ChildProcess running(bundle + "/ShareToNotes", "30");  // returns once it runs the executable
+    fs::copy_file("/bin/sleep", share + "/ShareToNotes", fs::copy_options::overwrite_existing);
+    qmtest::ChildProcess running(share + "/ShareToNotes", "30");  // returns once it runs the executable
     ASSERT_GT(running.pid(), 0);
-    Value refused = holdNotes();
+    Value refused = hold(client, 1, {Value(notes)});
     running.reap();
     ASSERT_EQ(errorCode(refused), 14u);
     EXPECT_EQ(errorText(refused), "plug-ins are busy");
     EXPECT_EQ(*refused.get("conflicts"),
               Value(Array{Value(Dictionary{{"MRBundleIdentifier", Value("ovaro.example.notes.share")}})}));
-    EXPECT_TRUE(holdNotes().get("uuids")) << "an exited process is busy no more";
+    EXPECT_TRUE(hold(client, 1, {Value(notes)}).get("uuids")) << "an exited process is busy no more";
 }
 
 TEST_F(Discovery, HostsGetTokensForBundlesAndSharedResourcesAndLaunchRegistrations) {
-    std::string share = roots.file("system/Notes.app/PlugIns/ShareToNotes.bundle");
     // A shared path that leaves its bundle through a link gets no token.
     fs::remove_all(share + "/Help");
     fs::create_directory_symlink(roots.file("system"), share + "/Help");
-    Value found = match({{"VTExtensionPointName", Value("ovaro.share-services")}});
-    const Value* form = this->form(found, "ovaro.example.notes.share");
-    ASSERT_TRUE(form);
-    const Value* extensions = form->get("extensions");
-    ASSERT_TRUE(extensions && extensions->isDictionary()) << form->description();
+    const Value offered = match(shareServices);
+    const Value* found = form(offered, "ovaro.example.notes.share");
+    ASSERT_TRUE(found);
+    const Value* extensions = found->get("extensions");
+    ASSERT_TRUE(extensions && extensions->isDictionary()) << found->description();
     EXPECT_TRUE(extensions->get("Resources"));
     EXPECT_FALSE(extensions->get("Help")) << "a link out of the bundle";
     EXPECT_FALSE(extensions->get("Templates")) << "no such resource";
-    EXPECT_TRUE(qmd->waitForLog("failed to make extension for " + share + "/Help"));
+    EXPECT_TRUE(qmd.waitForLog("failed to make extension for " + share + "/Help"));
 
-    Value shareUuid = uuidOf("ovaro.example.notes.share");
-    Value spellingUuid = uuidOf("ovaro.example.notes.spelling");
-
-    qmtest::ScopedEnvironment duct("QM_DUCT_DIR", qmd->runtimeDirectory());
-    Value access = send({{"request", Value("access")}, {"uuids", Value(Array{spellingUuid, shareUuid})}});
-    const qm::Array* tokens = access.get("extensions") ? access.get("extensions")->asArray() : nullptr;
-    ASSERT_TRUE(tokens && tokens->size() == 2) << access.description();
-    auto named = qm::verifyExtension(*(*tokens)[1].asString());
-    ASSERT_TRUE(named) << named.error().text();
-    EXPECT_EQ(named->path, fs::canonical(share).string());
-
-    EXPECT_EQ(send({{"request", Value("ready")}, {"uuids", Value(Array{spellingUuid, shareUuid, shareUuid})}}),
+    const Value shareUuid = uuidOf("ovaro.example.notes.share");
+    const Value spellingUuid = uuidOf("ovaro.example.notes.spelling");
+    // That "access" grants tokens naming each bundle is qmkit's access test.
+    EXPECT_EQ(client.ask({{"request", Value("ready")}, {"uuids", Value(Array{spellingUuid, shareUuid, shareUuid})}}),
               Value(Dictionary{}));
-    std::string services = qmd->runtimeDirectory() + "/services/" + std::to_string(::getpid());
+    const std::string services = qmd.runtimeDirectory() + "/services/" + std::to_string(::getpid());
     auto registration = qm::plist::readFile(services + "/ovaro.example.notes.share.plist");
     ASSERT_TRUE(registration) << registration.error().text();
-    std::string container = qmd->scratchPath("data/ovaro/Containers/ovaro.example.notes.share");
+    const std::string container = qmd.scratchPath("data/ovaro/Containers/ovaro.example.notes.share");
     Value expected(Dictionary{
         {"DuctService", Value(Dictionary{{"EnvironmentVariables", Value(Dictionary{{"HOME", Value(container)},
                                                                                    {"MRFIXED_USER_HOME", Value(container)},
@@ -360,58 +289,51 @@ TEST_F(Discovery, HostsGetTokensForBundlesAndSharedResourcesAndLaunchRegistratio
     EXPECT_EQ(*registration, expected);
     EXPECT_FALSE(fs::exists(services + "/ovaro.example.notes.spelling.plist")) << "a data plug-in launches nothing";
 
-    Value hold = send({{"request", Value("lock")}, {"flags", Value(std::uint64_t{2})}, {"paths", Value(Array{Value(share)})}});
-    ASSERT_TRUE(hold.get("uuids"));
-    EXPECT_EQ(errorText(send({{"request", Value("ready")}, {"uuids", Value(Array{shareUuid})}})),
+    ASSERT_TRUE(hold(client, 2, {Value(share)}).get("uuids"));
+    EXPECT_EQ(errorText(client.ask({{"request", Value("ready")}, {"uuids", Value(Array{shareUuid})}})),
               "access to plugin ovaro.example.notes.share denied: the plug-in is on hold");
-    EXPECT_EQ(send({{"request", Value("access")}, {"uuids", Value(Array{shareUuid})}}).get("extensions")->asArray()->size(), 1u)
+    EXPECT_EQ(client.ask({{"request", Value("access")}, {"uuids", Value(Array{shareUuid})}}).get("extensions")->asArray()->size(), 1u)
         << "tokens for a held plug-in all the same";
 }
 
+// Whether a grant stands is the consent store's test; here what the daemon
+// makes of each answer, a withdrawn grant and an unreadable file included.
 TEST_F(Discovery, AKeyboardIsSandboxedUnlessItsApplicationWasGrantedTheNetwork) {
-    std::string app = roots.file("Keys.app");
+    const std::string app = roots.file("Keys.app");
     qmtest::writeFile(app + "/Info.plist",
                       R"(<plist version="1.0"><dict><key>MRBundleIdentifier</key><string>ovaro.example.keys</string></dict></plist>)");
-    qmtest::writeFile(app + "/PlugIns/Keyboard.bundle/Info.plist", R"(<plist version="1.0"><dict>
-        <key>MRBundleIdentifier</key><string>ovaro.example.keys.keyboard</string>
-        <key>MRBundleExecutable</key><string>Keyboard</string>
-        <key>VTExtension</key><dict>
-          <key>VTExtensionPointIdentifier</key><string>ovaro.keyboard-service</string>
-          <key>VTExtensionProtocol</key><string>KeyboardProtocol</string>
-          <key>VTExtensionAttributes</key><dict><key>VTExtensionPointName</key><string>ovaro.keyboard-service</string>
-            <key>RequestsOpenAccess</key><true/></dict></dict></dict></plist>)");
+    const Dictionary attributes{{"VTExtensionPointName", Value("ovaro.keyboard-service")}, {"RequestsOpenAccess", Value(true)}};
+    qmtest::writePlist(app + "/PlugIns/Keyboard.bundle/Info.plist",
+                       Value(Dictionary{{"MRBundleIdentifier", Value("ovaro.example.keys.keyboard")}, {"MRBundleExecutable", Value("Keyboard")},
+                                        {"VTExtension", Value(Dictionary{{"VTExtensionPointIdentifier", Value("ovaro.keyboard-service")},
+                                                                         {"VTExtensionProtocol", Value("KeyboardProtocol")},
+                                                                         {"VTExtensionAttributes", Value(attributes)}})}}));
     qmtest::writeFile(app + "/PlugIns/Keyboard.bundle/Keyboard", "#!/bin/sh\n");
     fs::rename(app, roots.file("system/Keys.app"));
     ASSERT_TRUE(qmtest::eventually([&] { return !uuidOf("ovaro.example.keys.keyboard").isNull(); }));
-    Value uuid = uuidOf("ovaro.example.keys.keyboard");
+    const Value uuid = uuidOf("ovaro.example.keys.keyboard");
 
-    struct Case {
-        const char* name;
-        std::optional<std::string> consent;  // none: no file
-        const char* profile;
+    auto consent = [](const char* granted) {
+        return std::string(R"(<plist version="1.0"><dict><key>ovaro.example.keys</key><dict>)") +
+               "<key>ovaro.pvc.keyboard-network</key><" + granted + "/></dict></dict></plist>";
     };
-    const std::string granting = R"(<plist version="1.0"><dict><key>ovaro.example.keys</key><dict>)"
-                                 R"(<key>ovaro.pvc.keyboard-network</key><true/></dict></dict></plist>)";
-    const Case cases[] = {
-        {"no consent file", std::nullopt, "keyboard"},
-        {"granted", granting, "plugin"},
-        {"refused", R"(<plist version="1.0"><dict><key>ovaro.example.keys</key><dict>)"
-                    R"(<key>ovaro.pvc.keyboard-network</key><false/></dict></dict></plist>)", "keyboard"},
-        {"damaged", "<plist", "keyboard"},
-    };
-    std::string consentFile = qmd->scratchPath("data/ovaro/Consent.plist");
-    for (const Case& c : cases) {
+    // {consent file (none: no file), sandbox profile}
+    const std::pair<std::optional<std::string>, const char*> cases[] = {
+        {std::nullopt, "keyboard"}, {consent("true"), "plugin"}, {consent("false"), "keyboard"}, {"<plist", "keyboard"}};
+    const std::string consentFile = qmd.scratchPath("data/ovaro/Consent.plist");
+    for (const auto& [content, profile] : cases) {
+        SCOPED_TRACE(content.value_or("no file"));
         fs::remove(consentFile);
-        if (c.consent) {
-            qmtest::writeFile(consentFile, *c.consent);
+        if (content) {
+            qmtest::writeFile(consentFile, *content);
         }
-        ASSERT_EQ(send({{"request", Value("ready")}, {"uuids", Value(Array{uuid})}}), Value(Dictionary{})) << c.name;
-        auto registration = qm::plist::readFile(qmd->runtimeDirectory() + "/services/" + std::to_string(::getpid()) +
+        ASSERT_EQ(client.ask({{"request", Value("ready")}, {"uuids", Value(Array{uuid})}}), Value(Dictionary{}));
+        auto registration = qm::plist::readFile(qmd.runtimeDirectory() + "/services/" + std::to_string(::getpid()) +
                                                 "/ovaro.example.keys.keyboard.plist");
-        ASSERT_TRUE(registration) << c.name;
-        EXPECT_EQ(*registration->get("DuctService")->get("_SandboxProfile"), Value(c.profile)) << c.name;
+        ASSERT_TRUE(registration);
+        EXPECT_EQ(*registration->get("DuctService")->get("_SandboxProfile"), Value(profile));
     }
-    EXPECT_TRUE(qmd->waitForLog("PVCAccessCopyInformationForBundle failed for"));
+    EXPECT_TRUE(qmd.waitForLog("PVCAccessCopyInformationForBundle failed for"));
 }
 
 }  // namespace

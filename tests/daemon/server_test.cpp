@@ -6,8 +6,7 @@
 
 #include <unistd.h>
 
-#include <condition_variable>
-#include <mutex>
+#include <future>
 #include <thread>
 
 #include "daemon/QMDServer.h"
@@ -18,33 +17,6 @@
 #include "support/TestRegistry.h"
 
 namespace {
-
-// A job that holds mainQueue, as a long handler would, until released.
-class MainQueueBlocker {
-public:
-    explicit MainQueueBlocker(QMDServer& server) {
-        server.mainQueue().asyncOnWorker([this] {
-            std::unique_lock lock(mutex_);
-            blocking_ = true;
-            changed_.notify_all();
-            changed_.wait(lock, [this] { return released_; });
-        });
-        std::unique_lock lock(mutex_);
-        changed_.wait(lock, [this] { return blocking_; });
-    }
-    ~MainQueueBlocker() { release(); }
-    void release() {
-        std::lock_guard lock(mutex_);
-        released_ = true;
-        changed_.notify_all();
-    }
-
-private:
-    std::mutex mutex_;
-    std::condition_variable changed_;
-    bool blocking_ = false;
-    bool released_ = false;
-};
 
 class InProcessServer : public ::testing::Test {
 protected:
@@ -62,8 +34,18 @@ protected:
         }
         loop = std::thread([this] { server->run(); });
     }
+    // Holds mainQueue, as a long handler would, until releaseMainQueue().
+    void blockMainQueue() {
+        server->mainQueue().asyncOnWorker([this, released = release.get_future().share()] {
+            held.set_value();
+            released.wait();
+        });
+        held.get_future().wait();
+    }
+    void releaseMainQueue() { release.set_value(); }
     void TearDown() override {
         if (server) {
+            release = {};  // abandoned, should the test have failed before releasing it
             server->stop();
             loop.join();
         }
@@ -74,6 +56,7 @@ protected:
     QMDServer* server = nullptr;
     std::thread loop;
     std::string socketPath = dir.file("duct") + "/inprocess.qmd";
+    std::promise<void> held, release;
 };
 
 TEST_F(InProcessServer, NothingIsAnsweredBeforeTheRegistryIsReady) {
@@ -92,7 +75,7 @@ TEST_F(InProcessServer, NothingIsAnsweredBeforeTheRegistryIsReady) {
 TEST_F(InProcessServer, ALongHandlerNeitherDelaysAcceptsNorHangUpsNorServesTheDead) {
     start(/*scanned=*/true);
     std::string pid = std::to_string(::getpid());
-    MainQueueBlocker longHandler(*server);
+    blockMainQueue();
     {
         qmtest::FramePeer client(socketPath);
         ASSERT_TRUE(client.connected());
@@ -102,7 +85,7 @@ TEST_F(InProcessServer, ALongHandlerNeitherDelaysAcceptsNorHangUpsNorServesTheDe
         }
     }  // hangs up with three requests queued
     EXPECT_TRUE(log.waitFor("client " + pid + " is dead")) << "hang-up seen while mainQueue is busy";
-    longHandler.release();
+    releaseMainQueue();
     server->mainQueue().sync([] {});
     EXPECT_FALSE(log.contains("bulk options")) << "a dead client's queued requests ran:\n" << log.text();
 

@@ -152,11 +152,8 @@ TEST(Startup, APassedSocketThatCannotServeIsRefused) {
         {FramePeer::listenAt(dir.file("good.sock")), openDuct, "has mode 0755"},
     };
     for (const auto& [fd, duct, says] : cases) {
-        std::map<std::string, std::string> environment;
-        if (!duct.empty()) {
-            environment["QM_DUCT_DIR"] = duct;
-        }
-        DaemonProcess daemon({}, environment, "refused.qmd", {.launcher = {}, .passedSockets = {fd.get()}});
+        DaemonProcess daemon({}, duct.empty() ? std::map<std::string, std::string>{} : std::map<std::string, std::string>{{"QM_DUCT_DIR", duct}},
+                             "refused.qmd", {.launcher = {}, .passedSockets = {fd.get()}});
         auto status = daemon.waitForExit(std::chrono::seconds(10));
         ASSERT_TRUE(status) << says;
         EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 1) << says;
@@ -169,8 +166,7 @@ TEST(Startup, APassedSocketThatCannotServeIsRefused) {
 void expectOrderlyExit(DaemonProcess& daemon, const std::string& line) {
     auto status = daemon.waitForExit(std::chrono::seconds(10));
     ASSERT_TRUE(status);
-    EXPECT_TRUE(WIFEXITED(*status));
-    EXPECT_EQ(WEXITSTATUS(*status), 0);
+    EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 0) << *status;
     EXPECT_NE(daemon.log().find(line), std::string::npos) << daemon.log();
     struct stat info{};
     EXPECT_NE(::stat(daemon.socketPath().c_str(), &info), 0) << "socket left behind";

@@ -94,9 +94,7 @@ TEST(PlugInSetup, EachStyleGivesThePlugInDictionaryOfItsIdentifier) {
         ASSERT_TRUE(plugIn);
         EXPECT_EQ(plugIn->plugInDictionary(), c.plugIn);
         EXPECT_EQ(plugIn->isMultiplexed(), at(c.info, {"VTExtension"}).get("Multiple") || at(c.info, {"Quamber"}).get("Multiple"));
-        EXPECT_EQ(plugIn->identifier(), c.identifier);
-        EXPECT_EQ(plugIn->path(), kPath);
-        EXPECT_TRUE(plugIn->uuid().has_value());
+        EXPECT_EQ(plugIn->identifier(), c.identifier) << "the name given, whatever the attributes say";
         EXPECT_FALSE(plugIn->oldStyle());
         Value info = plugIn->bundleInfoDictionary();
         EXPECT_EQ(Value(info.asDictionary()->changing("VTExtension", std::nullopt)),

@@ -12,7 +12,6 @@ namespace {
 using modeltest::array;
 using modeltest::at;
 using modeltest::dict;
-using modeltest::LogCapture;
 using qm::Value;
 
 const std::string kPath = "/apps/Example.app/PlugIns/Share.bundle";
@@ -127,14 +126,12 @@ TEST(PlugInForm, AFormWithoutItsEssentialsSetsNothingUp) {
     auto original = resolvedPlugIn();
     ASSERT_TRUE(original);
     qm::Dictionary form = original->exportForm();
-    LogCapture log;
+    // What setup logs of each is the descriptor's test.
     for (const Value& broken : {Value(form.changing("path", std::nullopt)), Value(form.changing("path", 42)),
                                 Value(form.changing("identifier", std::nullopt)), Value(form.changing("bundleInfo", std::nullopt)),
                                 Value(form.changing("bundleInfo", array({}))), Value("not a form")}) {
         EXPECT_FALSE(QMPlugInCore::initWithForm(broken)) << broken.description();
     }
-    EXPECT_TRUE(log.contains("missing identifier in plug-in at " + kPath));
-    EXPECT_TRUE(log.contains("missing Info dictionary in plug-in com.example.share at " + kPath));
 }
 
 TEST(PlugInForm, ANeverCanonicalizedDescriptorExportsNoVersion) {

@@ -90,34 +90,32 @@ protected:
     ScopedEnvironment sdkPath{"QM_SDK_PATH", first + ":" + second};
 };
 
+// A test file is named without ".plist"; one that is no dictionary falls
+// through to the next place silently.
 TEST_F(SdkLookup, TheTestDirectoryComesFirstThenExtraThenTheSdkPathInOrder) {
     writePlist(testSdks + "/ovaro.s", sdkWithProtocol("from-test"));
     writePlist(extra + "/ovaro.s.plist", sdkWithProtocol("from-extra"));
-    writePlist(first + "/ovaro.s.plist", sdkWithProtocol("from-first"));
+    writePlist(testSdks + "/ovaro.later.plist", sdkWithProtocol("with-extension"));
+    writePlist(testSdks + "/ovaro.list", array({"not", "a", "dictionary"}));
+    qmtest::writeFile(testSdks + "/ovaro.broken", "<plist><dict><key>x</key>");
+    for (const char* name : {"ovaro.s", "ovaro.list", "ovaro.broken"}) {
+        writePlist(first + "/" + name + ".plist", sdkWithProtocol("from-first"));
+    }
     writePlist(second + "/ovaro.s.plist", sdkWithProtocol("from-second"));
     writePlist(second + "/ovaro.later.plist", sdkWithProtocol("from-second"));
-    writePlist(testSdks + "/ovaro.later.plist", sdkWithProtocol("with-extension"));  // not a test SDK's name
 
     EXPECT_EQ(protocolOf(SdkRegistry(), "ovaro.s"), Value("from-first"));
     EXPECT_EQ(protocolOf(SdkRegistry(), "ovaro.later"), Value("from-second"));
     EXPECT_EQ(protocolOf(SdkRegistry({extra}), "ovaro.s"), Value("from-extra"));
     ScopedEnvironment withTest("QMTEST_SDK", testSdks);
+    LogCapture log;
     EXPECT_EQ(protocolOf(SdkRegistry({extra}), "ovaro.s"), Value("from-test"));
     EXPECT_EQ(at(Value(*QMPlugInCore::readSDKDictionary("ovaro.s")), {"VTExtension", "VTExtensionProtocol"}),
               Value("from-test"));
-    EXPECT_EQ(protocolOf(SdkRegistry(), "ovaro.later"), Value("from-second"));
-}
-
-TEST_F(SdkLookup, ATestFileThatIsNotADictionaryFallsThroughSilently) {
-    writePlist(testSdks + "/ovaro.s", array({"not", "a", "dictionary"}));
-    qmtest::writeFile(testSdks + "/ovaro.broken", "<plist><dict><key>x</key>");
-    writePlist(first + "/ovaro.s.plist", sdkWithProtocol("from-first"));
-    writePlist(first + "/ovaro.broken.plist", sdkWithProtocol("from-first"));
-    ScopedEnvironment withTest("QMTEST_SDK", testSdks);
-    LogCapture log;
-    EXPECT_EQ(protocolOf(SdkRegistry(), "ovaro.s"), Value("from-first"));
-    EXPECT_EQ(protocolOf(SdkRegistry(), "ovaro.broken"), Value("from-first"));
-    EXPECT_TRUE(log.lines().empty());
+    for (const char* name : {"ovaro.later", "ovaro.list", "ovaro.broken"}) {
+        EXPECT_EQ(protocolOf(SdkRegistry(), name), Value(name == std::string("ovaro.later") ? "from-second" : "from-first")) << name;
+    }
+    EXPECT_TRUE(log.lines().empty()) << log.text();
 }
 
 TEST_F(SdkLookup, NamesThatWouldLeaveTheDirectoryAreNeverRegistered) {

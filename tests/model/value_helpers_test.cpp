@@ -38,15 +38,12 @@ TEST(CompareVersionString, DigitRunsByValueOtherBytesLiterallyLeadingZerosLast) 
         EXPECT_EQ(compareVersionString(a, b), std::strong_ordering::less) << a << " vs " << b;
         EXPECT_EQ(compareVersionString(b, a), std::strong_ordering::greater) << b << " vs " << a;
     }
-    for (const char* version : {"", "1.0", "18446744073709551616"}) {
-        EXPECT_EQ(compareVersionString(version, version), std::strong_ordering::equal) << version;
-    }
 }
 
 TEST(CompareVersionString, IsAStrictTotalOrder) {
     std::vector<std::string> versions{"", "0", "00", "1", "01", "1.0", "1.00", "1.0.0", "1.0a", "1.0b", "1.1",
                                       "1.01", "1.10", "1.9", "2", "2.0", "10", "9", "a", "a1", "a01", "a10",
-                                      "1.01.9", "1.1.8", "1-1", "1..1", "\xc3\xa9", "1.2.3b4"};
+                                      "1.01.9", "1.1.8", "1-1", "1..1", "\xc3\xa9", "1.2.3b4", "18446744073709551616"};
     for (const auto& a : versions) {
         for (const auto& b : versions) {
             auto ab = compareVersionString(a, b);

@@ -17,14 +17,13 @@
 
 namespace {
 
+using qm::Dictionary;
+using qm::Value;
+
 std::unique_ptr<QMDAnnotationStore> openStore(const std::string& path) {
     auto store = QMDAnnotationStore::initWithDatabase(path);
     EXPECT_TRUE(store) << store.error().text();
     return std::move(store).value();
-}
-
-qm::Dictionary annotation(std::initializer_list<qm::Dictionary::Entry> entries) {
-    return qm::Dictionary(entries);
 }
 
 TEST(AnnotationStore, AFileItCannotUseStartsAnEmptyTableAndSaysWhy) {
@@ -60,12 +59,11 @@ TEST(AnnotationStore, AFileItCannotUseStartsAnEmptyTableAndSaysWhy) {
             EXPECT_TRUE(log.contains("(resetting)")) << log.text();
         }
         // The next change writes a whole, current file.
-        store->setAnnotationForIdentifier(annotation({{"election", qm::Value(1)}}), "x");
+        store->setAnnotationForIdentifier(Dictionary{{"election", Value(1)}}, "x");
         auto written = qm::plist::readFile(path);
         ASSERT_TRUE(written);
-        EXPECT_EQ(*written, qm::Value(qm::Dictionary{
-                                {"version", qm::Value(16)},
-                                {"data", qm::Value(qm::Dictionary{{"x", qm::Value(annotation({{"election", qm::Value(1)}}))}})}}));
+        EXPECT_EQ(*written, Value(Dictionary{{"version", Value(16)},
+                                             {"data", Value(Dictionary{{"x", Value(Dictionary{{"election", Value(1)}})}})}}));
     }
 }
 
@@ -73,10 +71,10 @@ TEST(AnnotationStore, ChangesMergeByKeyAndSurviveAReopen) {
     qmtest::TempDir dir;
     std::string path = dir.file("Annotations");
     auto store = openStore(path);
-    store->setAnnotationForIdentifier(annotation({{"election", qm::Value(2)}}), "p");
-    store->setAnnotationForIdentifier(annotation({{"extension", qm::Value(annotation({{"a", qm::Value(1)}}))}}), "p");
-    store->setAnnotationForIdentifier(annotation({{"extension", qm::Value(annotation({{"b", qm::Value(2)}}))}}), "p");
-    qm::Value expected(annotation({{"election", qm::Value(2)}, {"extension", qm::Value(annotation({{"b", qm::Value(2)}}))}}));
+    store->setAnnotationForIdentifier(Dictionary{{"election", Value(2)}}, "p");
+    store->setAnnotationForIdentifier(Dictionary{{"extension", Value(Dictionary{{"a", Value(1)}})}}, "p");
+    store->setAnnotationForIdentifier(Dictionary{{"extension", Value(Dictionary{{"b", Value(2)}})}}, "p");
+    Value expected(Dictionary{{"election", Value(2)}, {"extension", Value(Dictionary{{"b", Value(2)}})}});
     EXPECT_EQ(store->annotationForIdentifier("p"), expected);
     EXPECT_EQ(openStore(path)->annotationForIdentifier("p"), expected) << "not what the file holds";
 }
@@ -86,9 +84,9 @@ TEST(AnnotationStore, AFailedSaveIsLoggedAndTheChangeKeptInMemory) {
     qmtest::LogCapture log;
     auto store = openStore(dir.file("missing-folder/Annotations"));
     EXPECT_TRUE(log.lines().empty()) << "a file that is not there loads silently: " << log.text();
-    store->setAnnotationForIdentifier(annotation({{"election", qm::Value(3)}}), "p");
+    store->setAnnotationForIdentifier(Dictionary{{"election", Value(3)}}, "p");
     EXPECT_TRUE(log.contains("unable to save annotations:")) << log.text();
-    EXPECT_EQ(store->annotationForIdentifier("p"), qm::Value(annotation({{"election", qm::Value(3)}})));
+    EXPECT_EQ(store->annotationForIdentifier("p"), Value(Dictionary{{"election", Value(3)}}));
 }
 
 TEST(AnnotationStore, TheDefaultFileLiesInAPrivateFolderOfTheStateDirectory) {
@@ -106,14 +104,14 @@ TEST(AnnotationStore, TheDefaultFileLiesInAPrivateFolderOfTheStateDirectory) {
 TEST(AnnotationStore, AWriterKilledAtAnyInstantLeavesAWholeFile) {
     qmtest::TempDir dir;
     std::string path = dir.file("Annotations");
-    openStore(path)->setAnnotationForIdentifier(annotation({{"election", qm::Value(0)}}), "p");
+    openStore(path)->setAnnotationForIdentifier(Dictionary{{"election", Value(0)}}, "p");
     std::mt19937 random(12345);
     for (int round = 0; round < 20; ++round) {
         pid_t child = ::fork();
         if (child == 0) {
             auto store = QMDAnnotationStore::initWithDatabase(path);
             for (std::int64_t i = 1;; ++i) {
-                (*store)->setAnnotationForIdentifier(annotation({{"election", qm::Value(i)}}), "p");
+                (*store)->setAnnotationForIdentifier(Dictionary{{"election", Value(i)}}, "p");
             }
         }
         ::usleep(static_cast<useconds_t>(std::uniform_int_distribution<int>(1000, 20000)(random)));

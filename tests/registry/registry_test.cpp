@@ -7,7 +7,6 @@
 
 #include <filesystem>
 
-#include "platform/plist/PropertyList.h"
 #include "registry/QMDatabase.h"
 #include "support/LogCapture.h"
 #include "support/TempDir.h"
@@ -26,15 +25,13 @@ protected:
     // the entitlements given.
     void addPlugIn(const std::string& name, const Dictionary& entitlements = {}) {
         std::string bundle = dir.file("root/Host.app/PlugIns/" + name + ".bundle");
-        fs::create_directories(bundle);
         Dictionary info{{"MRBundleIdentifier", Value(name)},
                         {"MRBundleExecutable", Value("run")},
                         {"VTExtension", Value(Dictionary{{"VTExtensionAttributes", Value(Dictionary{{"VTExtensionPointName", Value("point")}})},
                                                          {"VTExtensionProtocol", Value("Protocol")}})}};
-        ASSERT_FALSE(qm::plist::writeFileAtomically(bundle + "/Info.plist", Value(info), qm::plist::Format::xml));
+        qmtest::writePlist(bundle + "/Info.plist", Value(info));
         if (!entitlements.empty()) {
-            ASSERT_FALSE(qm::plist::writeFileAtomically(bundle + "/Entitlements.plist", Value(entitlements),
-                                                        qm::plist::Format::xml));
+            qmtest::writePlist(bundle + "/Entitlements.plist", Value(entitlements));
             ::chmod((bundle + "/Entitlements.plist").c_str(), 0644);
         }
     }
@@ -53,7 +50,6 @@ protected:
         return names;
     }
     void elect(const std::string& name, Value election) {
-        Dictionary rules{{"VTExtensionIdentifier", Value(name)}};
         auto plugIn = registry->findPlugInAtPath(dir.file("root/Host.app/PlugIns/" + name + ".bundle"));
         ASSERT_TRUE(plugIn) << name;
         registry->setAnnotationForPlugIn(Dictionary{{"election", election}}, *plugIn);

@@ -9,7 +9,6 @@
 #include <gtest/gtest.h>
 
 #include <array>
-#include <cstring>
 #include <filesystem>
 
 #include "support/Eventually.h"
@@ -22,12 +21,13 @@ namespace {
 // Starts the program with `extra` added to (or replacing) the test's own
 // environment, its standard streams on the given descriptors (-1: the test's).
 // `passed` descriptors become 3, 4, ... with LISTEN_FDS and LISTEN_PID set, as
-// systemd passes sockets.
+// systemd passes sockets; LISTEN_PID, the program's own pid, is set by a
+// shell that then execs the program.
 pid_t spawn(std::vector<std::string> argv, std::map<std::string, std::string> extra, std::array<int, 3> streams,
             const std::vector<int>& passed = {}) {
     if (!passed.empty()) {
         extra["LISTEN_FDS"] = std::to_string(passed.size());
-        extra["LISTEN_PID"] = std::string(20, '0');  // the child writes its pid here
+        argv.insert(argv.begin(), {"/bin/sh", "-c", "LISTEN_PID=$$; export LISTEN_PID; exec \"$@\"", "sh"});
     }
     std::vector<std::string> environment;
     for (const auto& [k, v] : extra) {
@@ -39,15 +39,11 @@ pid_t spawn(std::vector<std::string> argv, std::map<std::string, std::string> ex
         }
     }
     std::vector<char*> argp, envp;
-    char* listenPid = nullptr;
     for (auto& a : argv) {
         argp.push_back(a.data());
     }
     for (auto& e : environment) {
         envp.push_back(e.data());
-        if (e.starts_with("LISTEN_PID=")) {
-            listenPid = e.data() + std::strlen("LISTEN_PID=");
-        }
     }
     argp.push_back(nullptr);
     envp.push_back(nullptr);
@@ -68,25 +64,14 @@ pid_t spawn(std::vector<std::string> argv, std::map<std::string, std::string> ex
                 ::dup2(streams[static_cast<std::size_t>(fd)], fd);
             }
         }
-        if (listenPid != nullptr) {
-            // Out of the way first, so that moving one to 3 + i never
-            // overwrites another still to move.
-            for (std::size_t i = 0; i < passed.size(); ++i) {
-                high[i] = ::fcntl(passed[i], F_DUPFD, kFirstHighDescriptor);
-            }
-            for (std::size_t i = 0; i < passed.size(); ++i) {
-                ::dup2(high[i], 3 + static_cast<int>(i));  // dup2 clears close-on-exec
-                ::close(high[i]);
-            }
-            char digits[24];
-            int count = 0;
-            for (auto n = static_cast<unsigned long>(::getpid()); n > 0; n /= 10) {
-                digits[count++] = static_cast<char>('0' + n % 10);
-            }
-            while (count > 0) {
-                *listenPid++ = digits[--count];
-            }
-            *listenPid = '\0';
+        // Out of the way first, so that moving one to 3 + i never overwrites
+        // another still to move.
+        for (std::size_t i = 0; i < passed.size(); ++i) {
+            high[i] = ::fcntl(passed[i], F_DUPFD, kFirstHighDescriptor);
+        }
+        for (std::size_t i = 0; i < passed.size(); ++i) {
+            ::dup2(high[i], 3 + static_cast<int>(i));  // dup2 clears close-on-exec
+            ::close(high[i]);
         }
         ::execve(argp[0], argp.data(), envp.data());
         ::_exit(127);

@@ -121,6 +121,15 @@ std::optional<qm::Value> FramePeer::roundTrip(const qm::Value& message, std::chr
     return std::nullopt;
 }
 
+qm::Value FramePeer::ask(qm::Dictionary request) {
+    if (!request.contains("version")) {
+        request.set("version", qm::Value(std::uint64_t{3}));
+    }
+    auto reply = roundTrip(qm::Value(std::move(request)));
+    EXPECT_TRUE(reply) << "no reply";
+    return reply.value_or(qm::Value());
+}
+
 bool FramePeer::waitForClose(std::chrono::milliseconds timeout) {
     std::uint8_t buffer[65536];
     for (auto deadline = Clock::now() + timeout; readable(socket_.get(), deadline);) {

@@ -46,6 +46,9 @@ public:
     std::optional<Frame> receive(std::chrono::milliseconds timeout = std::chrono::seconds(5));
     // Sends a message and waits for the body of its reply.
     std::optional<qm::Value> roundTrip(const qm::Value& message, std::chrono::milliseconds timeout = std::chrono::seconds(5));
+    // A request at the current version (unless it names one) and its reply;
+    // null, and a test failure, when none comes.
+    qm::Value ask(qm::Dictionary request);
     // True when the other end closed within the timeout (what it still sent
     // is read and dropped).
     bool waitForClose(std::chrono::milliseconds timeout = std::chrono::seconds(5));

@@ -57,21 +57,16 @@ protected:
     // Asks "holds" until `done` accepts the list (at most 5 s); the last list.
     qm::Array holdsWhen(const std::function<bool(const qm::Array&)>& done) {
         qm::Array holds;
-        for (int i = 0; i < 250; ++i, std::this_thread::sleep_for(20ms)) {
-            const qm::Value reply = json({"holds"});
-            const qm::Value* listed = reply.get("holds");
-            holds = listed && listed->asArray() ? *listed->asArray() : qm::Array{};
-            if (done(holds)) {
-                break;
-            }
-        }
+        qmtest::eventually([&] {
+            const qm::Value listed = at(json({"holds"}), {"holds"});
+            holds = listed.asArray() ? *listed.asArray() : qm::Array{};
+            return done(holds);
+        });
         return holds;
     }
     std::string uuidOf(const std::string& identifier) {
-        qm::Value found = json({"send", R"({"request": "match", "rules": {"VTExtensionIdentifier": ")" + identifier + "\"}}"});
-        const qm::Value* matches = found.get("matches");
-        const qm::Value* uuid = matches && matches->asArray() && !matches->asArray()->empty()
-                                    ? matches->asArray()->front().get("uuid") : nullptr;
+        const qm::Value matches = at(json({"send", R"({"request": "match", "rules": {"VTExtensionIdentifier": ")" + identifier + "\"}}"}), {"matches"});
+        const qm::Value* uuid = matches.asArray() && !matches.asArray()->empty() ? matches.asArray()->front().get("uuid") : nullptr;
         return uuid && uuid->asString() ? *uuid->asString() : "";
     }
 
@@ -88,7 +83,8 @@ bool startsWith(const std::string& text, const std::string& prefix) {
     return prefix.empty() ? text.empty() : text.rfind(prefix, 0) == 0;
 }
 
-// Runs without a daemon: help, version and every usage error.
+// Runs without a daemon: help, version and every usage error. What the JSON
+// reader says of bad text is its own test.
 TEST(QmkitUsage, AnswersWithoutADaemon) {
     // {arguments, exit status, how standard output starts and how standard error starts (empty: nothing)}
     const std::string kTooLarge = "is too large (at most 18446744073709551615)\n";
@@ -111,9 +107,7 @@ TEST(QmkitUsage, AnswersWithoutADaemon) {
         {{"send"}, 2, "", "qmkit: send: expected one JSON object"},
         {{"send", "{\"request\": "}, 2, "", "qmkit: send: invalid JSON: "},
         {{"send", "[\"bulk\"]"}, 2, "", "qmkit: send: the request must be a JSON object"},
-        {{"send", "{\"flags\": 18446744073709551616}"}, 2, "",
-         "qmkit: send: invalid JSON: integer does not fit in 64 bits at line 1, column 11\n"},
-        {{"send", "-"}, 2, "", "qmkit: send: invalid JSON: syntax error while parsing value - unexpected end of input"},
+        {{"send", "-"}, 2, "", "qmkit: send: invalid JSON: "},  // nothing on standard input
         {{"bulk", "--flags", "lots"}, 2, "", "qmkit: bulk: --flags must be a number (decimal or 0x-hex), not \"lots\""},
         {{"bulk", "--flags", "0x"}, 2, "", "qmkit: bulk: --flags must be a number"},
         {{"bulk", "--flags", "18446744073709551616"}, 2, "", "qmkit: bulk: --flags 18446744073709551616 " + kTooLarge},
@@ -180,7 +174,6 @@ TEST_F(Qmkit, TheDaemonsRepliesAndRefusals) {
         {{"send", "-"}, "{\"request\": \"bulk\",\n \"flags\": 7}\n", 0, "{}\n", "", "bulk options 0x7 not supported"},
         {{"send", "{\"request\": \"bulk\", \"version\": 1}"}, "", 1, "",
          "qmkit: unsupported protocol version 1 (current 3) (code 7)\n"},
-        {{"send", "{\"request\": \"Add\"}"}, "", 1, "", unrecognized},
         {{"--json", "send",
           "{\"request\": \"x-unknown\", \"uuids\": [{\"$uuid\": \"0d3c1f5e-8a51-4c7e-9f6b-2d7f1e0a9b34\"}]}"},
          "",
@@ -209,9 +202,9 @@ protected:
             {"QM_SDK_PATH", kExamples + "/SDKs"}, {"XDG_DATA_HOME", dir.file("data")}, {"QM_LOG_STDERR", "0"}});
         return runProgram(arguments, environment);
     }
-    Value json(std::vector<std::string> arguments, std::map<std::string, std::string> environment = {}) {
+    Value json(std::vector<std::string> arguments) {
         arguments.push_back("--json");
-        auto result = inspect(arguments, environment);
+        auto result = inspect(arguments);
         EXPECT_EQ(result.exitStatus, 0) << result.err;
         auto parsed = qm::json::parse(result.out);
         EXPECT_TRUE(parsed.ok()) << result.out;
@@ -236,10 +229,6 @@ TEST_F(QmkitInspect, ItsOutputAndExitStatus) {
     const std::string noSdks = dir.file("no-sdks");
     const std::string usage = "usage: qmkit inspect BUNDLE";
     const std::string shareSdk = kExamples + "/SDKs/ovaro.share-services.plist";
-    const std::string notAPlugIn = dir.file("Plain.bundle");
-    fs::create_directories(notAPlugIn);
-    qmtest::writeFile(notAPlugIn + "/Info.plist", R"(<?xml version="1.0" encoding="UTF-8"?>
-<plist version="1.0"><dict><key>MRBundleIdentifier</key><string>x.plain</string></dict></plist>)");
     const Case cases[] = {
         {{share, "-v"}, 0,
          {"plug-in ovaro.example.notes.share\n", "  path: " + share + "\n", "  extension point: ovaro.share-services\n",
@@ -263,18 +252,8 @@ TEST_F(QmkitInspect, ItsOutputAndExitStatus) {
         {{kStudio + "Hybrid.bundle"}, 1, {"  valid: no: hybrid plug-ins are not supported on this platform (code 12)\n"},
          "qmkit: plug-in ovaro.example.studio.hybrid in " + kStudio +
              "Hybrid.bundle: hybrid plug-ins are not supported on this platform (code 12)\n"},
-        // Paths that are no plug-in bundle say which way.
-        {{filters, "-i", "ovaro.example.studio.none"}, 1, {},
-         "qmkit: no plug-in ovaro.example.studio.none in the bundle at " + filters +
-             "; it has ovaro.example.studio.blur, ovaro.example.studio.sharpen (code 12)\n"},
-        {{kStudio + "Broken.bundle"}, 1, {},
-         "qmkit: unreadable Info dictionary in plug-in bundle at " + kStudio + "Broken.bundle: "},
+        // A path that is no plug-in bundle; each way it can fail is the model's test.
         {{dir.file("Nowhere.bundle")}, 1, {}, "qmkit: no plug-in bundle at " + dir.file("Nowhere.bundle") + ": no such path (code 9)\n"},
-        {{notAPlugIn + "/Info.plist"}, 1, {}, "qmkit: no plug-in bundle at " + notAPlugIn + "/Info.plist: not a directory (code 9)\n"},
-        {{dir.path()}, 1, {}, "qmkit: no plug-in bundle at " + dir.path() + ": no Info.plist"},
-        {{kExamples + "/Applications/Notes.app"}, 1, {},
-         "Notes.app is an application, not a plug-in bundle; its plug-ins: " + kNotes + "LegacyImport.bundle, "},
-        {{notAPlugIn}, 1, {}, "declares no plug-in: its Info dictionary has neither \"VTExtension\" nor \"Quamber\" (code 12)\n"},
         {{}, 2, {}, usage},
         {{"--frobnicate", share}, 2, {}, usage},
         {{share, "-i"}, 2, {}, usage},
@@ -292,15 +271,13 @@ TEST_F(QmkitInspect, ItsOutputAndExitStatus) {
     }
 }
 
-// What the form holds is the model's test; here that -v prints it whole and
-// that the JSON carries the verdict and the provenance.
+// What the form holds is the model's test; here that the JSON carries the
+// verdict, the form and the provenance, for each plug-in of a bundle.
 TEST_F(QmkitInspect, JsonCarriesTheVerdictTheFormAndTheProvenance) {
     Value share = json({kNotes + "ShareToNotes.bundle", "-v", "--provenance"});
     EXPECT_EQ(at(share, {"valid"}), Value(true));
     EXPECT_EQ(at(share, {"sdk", "file"}), Value(kExamples + "/SDKs/ovaro.share-services.plist"));
     EXPECT_EQ(at(share, {"form", "identifier"}), Value("ovaro.example.notes.share"));
-    EXPECT_EQ(at(share, {"form", "systemResident"}), Value(false));
-    EXPECT_EQ(at(share, {"form", "bundleInfo", "VTExtension", "CleanTimeout"}), Value(30));
     const qm::Array* origins = at(share, {"provenance"}).asArray();
     ASSERT_TRUE(origins);
     const Value cleanTimeout(qm::Dictionary{{"key", Value(qm::Array{Value("VTExtension"), Value("CleanTimeout")})},
@@ -308,10 +285,6 @@ TEST_F(QmkitInspect, JsonCarriesTheVerdictTheFormAndTheProvenance) {
                                             {"source", Value("sdk")},
                                             {"file", Value(kExamples + "/SDKs/ovaro.share-services.plist")}});
     EXPECT_NE(std::find(origins->begin(), origins->end(), cleanTimeout), origins->end());
-
-    Value widget = json({kNotes + "NotesWidget.xbun", "-v"}, {{"QM_SYSTEM_ROOTS", kExamples + "/Applications"}});
-    EXPECT_EQ(at(widget, {"form", "systemResident"}), Value(true));
-    EXPECT_EQ(at(widget, {"form", "info", "PrincipalClass"}), Value("VTObject"));
 
     Value forms = json({kStudio + "Filters.bundle"});
     ASSERT_TRUE(forms.isArray() && forms.asArray()->size() == 2) << forms.description();
@@ -332,20 +305,14 @@ TEST_F(QmkitInspect, JsonCarriesTheVerdictTheFormAndTheProvenance) {
 // Each way a hold ends; the daemon goes last. Relative paths are the
 // working directory's: the daemon resolves them in its own.
 TEST_F(Qmkit, AHoldLastsUntilReleasedOrInterruptedOrCutOff) {
-    struct Case {
-        const char* ending;
-        int exitStatus;
-        std::string err;
-    };
-    const Case cases[] = {
-        {"release", 0, ""},
-        {"SIGTERM", 0, ""},
-        {"SIGINT", 0, ""},
+    // {how it ends, exit status, standard error}
+    const std::tuple<std::string, int, std::string> cases[] = {
+        {"release", 0, ""}, {"SIGTERM", 0, ""}, {"SIGINT", 0, ""},
         {"daemon killed", 3, "qmkit: connection invalid: daemon closed the connection\n"},
     };
     const std::string executable = fs::canonical(QMKIT_BINARY_PATH).string();
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.ending);
+    for (const auto& [ending, exitStatus, err] : cases) {
+        SCOPED_TRACE(ending);
         qmtest::RunningProgram holder(command({"hold", "Notes.app"}, roots_.file("system")), environment());
         qm::Array holds = holdsWhen([](const qm::Array& listed) { return listed.size() == 1; });
         ASSERT_EQ(holds.size(), 1u) << "the hold is not listed";
@@ -360,22 +327,22 @@ TEST_F(Qmkit, AHoldLastsUntilReleasedOrInterruptedOrCutOff) {
             EXPECT_NE(listed.out.find(cell), std::string::npos) << cell << " in " << listed.out;
         }
 
-        if (c.ending == std::string("release")) {
+        if (ending == "release") {
             ProgramResult released = qmkit({"release", token});
             EXPECT_EQ(released.exitStatus, 0) << released.err;
             EXPECT_EQ(released.out, "");
-        } else if (c.ending == std::string("daemon killed")) {
+        } else if (ending == "daemon killed") {
             ASSERT_GT(daemon_.pid(), 0);
             ::kill(daemon_.pid(), SIGKILL);
         } else {
-            holder.signal(c.ending == std::string("SIGINT") ? SIGINT : SIGTERM);
+            holder.signal(ending == "SIGINT" ? SIGINT : SIGTERM);
         }
         const ProgramResult held = holder.wait();
-        EXPECT_EQ(held.exitStatus, c.exitStatus) << held.err;
+        EXPECT_EQ(held.exitStatus, exitStatus) << held.err;
         EXPECT_EQ(held.out, token + "\n");
-        EXPECT_EQ(held.err, c.err);
+        EXPECT_EQ(held.err, err);
         // A killed daemon may not be reaped yet: "running" would not tell.
-        if (c.ending != std::string("daemon killed")) {
+        if (ending != "daemon killed") {
             EXPECT_TRUE(holdsWhen([](const qm::Array& now) { return now.empty(); }).empty());
         }
     }
@@ -485,6 +452,8 @@ TEST_F(Qmkit, ListShowsVerdictsAndWatchPrintsEveryChange) {
     const std::size_t expected = 7 + 2 + 2 + 7;
     ASSERT_TRUE(qmtest::eventually([&] { return events(json.outputSoFar(), jsonStart).size() >= expected; }))
         << json.outputSoFar();
+    const std::map<std::string, int> expectedCounts{{"installed", 7}, {"election", 2}, {"held", 1}, {"released", 1},
+                                                    {"uninstalled", 7}};
     std::map<std::string, int> counts;
     for (const Value& event : events(json.outputSoFar(), jsonStart)) {
         const std::string name = *event.get("event")->asString();
@@ -499,8 +468,11 @@ TEST_F(Qmkit, ListShowsVerdictsAndWatchPrintsEveryChange) {
             EXPECT_EQ(event.get("path")->asString()->rfind(studio, 0), 0u) << event.description();
         }
     }
-    EXPECT_EQ(counts, (std::map<std::string, int>{{"installed", 7}, {"election", 2}, {"held", 1}, {"released", 1},
-                                                   {"uninstalled", 7}}));
+    EXPECT_EQ(counts, expectedCounts);
+    ASSERT_TRUE(qmtest::eventually([&] {
+        const std::string out = text.outputSoFar();
+        return std::count(out.begin() + static_cast<std::ptrdiff_t>(textStart), out.end(), '\n') >= static_cast<std::ptrdiff_t>(expected);
+    })) << text.outputSoFar();
 
     text.signal(SIGTERM);
     json.signal(SIGTERM);
@@ -508,20 +480,13 @@ TEST_F(Qmkit, ListShowsVerdictsAndWatchPrintsEveryChange) {
     for (const ProgramResult* watcher : {&textResult, &jsonResult}) {
         EXPECT_EQ(watcher->exitStatus, 0) << watcher->err;
     }
+    // Each watcher splits the changes between its looks as they fall: only the counts agree.
     std::istringstream lines(textResult.out.substr(textStart));
-    std::vector<std::string> textEvents;
-    for (std::string time, event, rest; lines >> time >> event && std::getline(lines, rest);) {
+    std::map<std::string, int> textCounts;
+    for (std::string time, event, rest; lines >> time >> event && std::getline(lines, rest); ++textCounts[event]) {
         EXPECT_EQ(time.size(), std::string("2026-11-23T19:04:05.123+00:00").size()) << time;
-        textEvents.push_back(event);
     }
-    std::vector<std::string> jsonEvents;
-    for (const Value& event : events(jsonResult.out, jsonStart)) {
-        jsonEvents.push_back(*event.get("event")->asString());
-    }
-    // Each watcher splits the changes between its looks as they fall.
-    std::sort(textEvents.begin(), textEvents.end());
-    std::sort(jsonEvents.begin(), jsonEvents.end());
-    EXPECT_EQ(textEvents, jsonEvents);
+    EXPECT_EQ(textCounts, expectedCounts) << textResult.out;
 }
 
 }  // namespace
