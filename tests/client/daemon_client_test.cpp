@@ -45,7 +45,7 @@ protected:
 // Handlers run on the reply queue in the order the replies come, which here
 // is the reverse of the requests'. No service name means the default service.
 TEST_F(DaemonClient, EveryRequestSendsItsEnvelopeAndKeysAndGetsItsOwnReply) {
-    connect(nullptr);
+    ASSERT_NO_FATAL_FAILURE(connect(nullptr));
     qm::Uuid u1 = qm::Uuid::random();
     qm::Uuid u2 = qm::Uuid::random();
     Dictionary rules{{"VTExtensionPointName", "ovaro.share"}};
@@ -146,7 +146,7 @@ TEST_F(DaemonClient, ErrorRepliesBecomeQuamberErrorsWithTheirCodeAndMessage) {
 // What a lost connection does to pending and later requests is the
 // transport's test; the library logs it, once.
 TEST_F(DaemonClient, AReplyThatNeverComesTimesOutAndAHangUpIsLoggedOnce) {
-    connect();
+    ASSERT_NO_FATAL_FAILURE(connect());
     auto reply = client_->sendAndWait(client_->request("bulk"), 100ms);
     ASSERT_FALSE(reply.ok());
     EXPECT_EQ(reply.error().domain, "duct");
@@ -172,7 +172,7 @@ TEST_F(DaemonClient, PackingHappensOnlyAtVersionThree) {
     ASSERT_TRUE(packed.has_value());
     EXPECT_EQ(packed->type(), qm::ValueType::packed);
 
-    connect();
+    ASSERT_NO_FATAL_FAILURE(connect());
     auto reply = client_->waitForReply(
         [&](auto handler) {
             client_->matchPlugIns({}, 0, handler);

@@ -3,18 +3,10 @@
 // variables set for one test and restored after it, and short value literals.
 
 #include <initializer_list>
-#include <ostream>
 
 #include "platform/value/Value.h"
 #include "support/LogCapture.h"
 #include "support/ScopedEnvironment.h"
-
-namespace qm {
-// Readable values in test failure messages.
-inline void PrintTo(const Value& value, std::ostream* out) {
-    *out << value.description();
-}
-}  // namespace qm
 
 namespace modeltest {
 

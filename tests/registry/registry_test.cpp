@@ -111,4 +111,27 @@ TEST_F(Registry, RecordsAreBuiltOnceAndAutoElectedWithoutANotification) {
     EXPECT_TRUE(log.contains("AppCatalog cannot find plug-in with UUID:")) << log.text();
 }
 
+// Pages are cut from one order, refused bundles included, and the total
+// counts every entry of the listing, not the page.
+TEST_F(Registry, ListingsArePagedInPathOrder) {
+    for (const char* name : {"a", "b", "c", "d"}) {
+        addPlugIn(name);
+    }
+    qmtest::writeFile(dir.file("root/Host.app/PlugIns/bb.bundle/Info.plist"), "not a property list");
+    open();
+    auto names = [&](const std::optional<std::string>& point, std::size_t offset, std::size_t limit) {
+        auto listing = registry->listPlugIns(point, offset, limit);
+        std::string text = std::to_string(listing.total) + ":";
+        for (const auto& listed : listing.page) {
+            text += " " + fs::path(listed.path).stem().string() + (listed.invalidReason ? "!" : "");
+        }
+        return text;
+    };
+    EXPECT_EQ(names(std::nullopt, 0, 1000), "5: a b bb! c d");
+    EXPECT_EQ(names(std::nullopt, 1, 2), "5: b bb!");
+    EXPECT_EQ(names("point", 2, 5), "4: c d");
+    EXPECT_EQ(names("point", 4, 5), "4:");
+    EXPECT_EQ(names("other", 0, 5), "0:");
+}
+
 }  // namespace

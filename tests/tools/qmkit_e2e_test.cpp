@@ -397,6 +397,10 @@ TEST_F(Qmkit, ListShowsVerdictsAndWatchPrintsEveryChange) {
     EXPECT_NE(widgets.out.find("\tovaro.example.notes.widget\t1.0\tovaro.widget\t"), std::string::npos);
     EXPECT_NE(widgets.out.find("Inspector.xbun\tinvalid: Application Extensions may not use the \"PrincipalClass\" key"),
               std::string::npos);
+    const std::string badPage = "qmkit: \"offset\" and \"limit\" must be unsigned integers, \"limit\" at most 1000 (code 4)\n";
+    EXPECT_EQ(qmkit({"send", R"({"request": "list", "limit": 1001})"}).err, badPage);
+    EXPECT_EQ(qmkit({"send", R"({"request": "list", "offset": -1})"}).err, badPage);
+    EXPECT_EQ(qmkit({"send", R"({"request": "list", "point": 7})"}).err, "qmkit: \"point\" must be a string (code 4)\n");
 
     // Studio leaves before the watchers start and comes back while they run.
     const std::string parked = roots_.file("Studio.app");

@@ -6,6 +6,7 @@
 #include <cmath>
 #include <cstdio>
 #include <limits>
+#include <ostream>
 
 namespace qm {
 
@@ -292,6 +293,14 @@ std::string Value::description() const {
     std::string out;
     appendDescription(out);
     return out;
+}
+
+std::ostream& operator<<(std::ostream& out, const Value& value) {
+    return out << value.description();
+}
+
+std::ostream& operator<<(std::ostream& out, const Dictionary& dictionary) {
+    return out << Value(dictionary).description();
 }
 
 void Value::appendDescription(std::string& out) const {

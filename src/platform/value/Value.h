@@ -10,6 +10,7 @@
 // may be handed between threads freely.
 
 #include <cstdint>
+#include <iosfwd>
 #include <memory>
 #include <optional>
 #include <string>
@@ -158,5 +159,9 @@ private:
 // included) has no such key or its value is not a string.
 std::optional<std::string> stringAt(const Value& dictionary, std::string_view key);
 std::optional<std::string> stringAt(const Value* dictionary, std::string_view key);
+
+// The description, for streams (test failures, debugging).
+std::ostream& operator<<(std::ostream& out, const Value& value);
+std::ostream& operator<<(std::ostream& out, const Dictionary& dictionary);
 
 }  // namespace qm
