@@ -274,6 +274,20 @@ TEST(PropertyList, HostileBinaryListsAreRefusedAndHonestOnesRead) {
         exponential.push_back(arrayObject({i + 1, i + 1}, 1));
     }
     exponential.push_back(kTrueObject);
+    // Levels of 14 references each to the next: 14^4 leaves stay within what
+    // any list may expand to, 14^5 from a hundred bytes do not.
+    auto fourteenWide = [](std::uint64_t levels) {
+        std::vector<qm::Bytes> objects;
+        for (std::uint64_t i = 0; i < levels; ++i) {
+            objects.push_back(arrayObject(std::vector<std::uint64_t>(14, i + 1), 1));
+        }
+        objects.push_back(kTrueObject);
+        return binaryList(objects, 1);
+    };
+    Value fourLevels(true);
+    for (int i = 0; i < 4; ++i) {
+        fourLevels = Value(Array(14, fourLevels));
+    }
     const qm::Bytes twoKeys{0xD2, 1, 2, 3, 3};
     // {what, the list, the error code (0: read as the value)}
     const std::tuple<const char*, qm::Bytes, int, Value> cases[] = {
@@ -287,6 +301,8 @@ TEST(PropertyList, HostileBinaryListsAreRefusedAndHonestOnesRead) {
         {"a key twice", binaryList({twoKeys, {0x51, 'a'}, {0x51, 'a'}, kTrueObject}, 1), kErrorMalformed, {}},
         {"200000 levels", binaryList(deep, 4), kErrorTooComplex, {}},
         {"shared exponentially", binaryList(exponential, 1), kErrorTooComplex, {}},
+        {"shared to 40 thousand nodes", fourteenWide(4), 0, fourLevels},
+        {"shared to half a million nodes", fourteenWide(5), kErrorTooComplex, {}},
         {"a cycle", binaryList({arrayObject({1}, 1), arrayObject({0}, 1)}, 1), kErrorMalformed, {}},
         {"a reference past the end", binaryList({arrayObject({7}, 1)}, 1), kErrorMalformed, {}},
         {"a top object past the end", binaryList({kTrueObject}, 1, 3), kErrorMalformed, {}},

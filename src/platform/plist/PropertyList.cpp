@@ -43,7 +43,7 @@ qm::Result<qm::Value> parse(std::span<const std::uint8_t> bytes) {
     const char* text = reinterpret_cast<const char*>(bytes.data());
     auto length = static_cast<std::uint32_t>(bytes.size());
     bool binary = plist_is_binary(text, length) != 0;
-    qm::MaybeError unsafe = binary ? checkBinaryStructure(bytes, kMaxNesting, kMaxBinaryNodes)
+    qm::MaybeError unsafe = binary ? checkBinaryStructure(bytes, kMaxNesting, binaryNodeBound(bytes.size()))
                                    : checkXmlStructure(std::string_view(text, bytes.size()), kMaxNesting);
     if (unsafe) {
         return *unsafe;

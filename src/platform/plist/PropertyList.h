@@ -21,11 +21,12 @@
 // - libplist's UID nodes are refused when read.
 //
 // Hostile input: files over 64 MiB are refused before reading; nesting deeper
-// than 512 containers, binary lists whose shared objects would expand to more
-// than 4 Mi nodes and binary keys with NUL are refused before libplist builds
-// anything (it recurses once per level, copies shared objects and asserts on
-// such keys). Every function may be called from any thread.
+// than 512 containers, binary lists whose shared objects would expand past
+// binaryNodeBound() and binary keys with NUL are refused before libplist
+// builds anything (it recurses once per level, copies shared objects and
+// asserts on such keys). Every function may be called from any thread.
 
+#include <algorithm>
 #include <cstdint>
 #include <span>
 #include <string>
@@ -48,6 +49,18 @@ enum ErrorCode : int {
 inline constexpr std::size_t kMaxBytes = 64u * 1024 * 1024;
 inline constexpr unsigned kMaxNesting = 512;
 inline constexpr std::uint64_t kMaxBinaryNodes = 4u * 1024 * 1024;
+
+// How many nodes a binary list of this many bytes may expand to. Without
+// shared containers every node but the top is one reference of at least one
+// byte, so honest lists stay under one node per byte; four per byte (and 64 Ki
+// for any list) leaves room, while a few kilobytes of containers referring to
+// each other can no longer make a tree of millions of nodes (about 120 bytes
+// each once built).
+constexpr std::uint64_t binaryNodeBound(std::size_t bytes) {
+    constexpr std::uint64_t kNodesPerByte = 4;
+    constexpr std::uint64_t kFloor = 64 * 1024;
+    return std::min(kMaxBinaryNodes, std::max(kFloor, kNodesPerByte * bytes));
+}
 
 // Seconds between 1970-01-01 and 2001-01-01, the reference date of property lists.
 inline constexpr double kSecondsFrom1970To2001 = 978307200;
