@@ -123,7 +123,7 @@ std::optional<qm::Value> FramePeer::roundTrip(const qm::Value& message, std::chr
 
 qm::Value FramePeer::ask(qm::Dictionary request) {
     if (!request.contains("version")) {
-        request.set("version", qm::Value(std::uint64_t{3}));
+        request.set("version", qm::Value(wire::kCurrentVersion));
     }
     auto reply = roundTrip(qm::Value(std::move(request)));
     EXPECT_TRUE(reply) << "no reply";

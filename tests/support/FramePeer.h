@@ -13,6 +13,7 @@
 
 #include "platform/fd/UniqueFd.h"
 #include "platform/value/Value.h"
+#include "protocol/WireKeys.h"
 
 namespace qmtest {
 
@@ -69,7 +70,7 @@ qm::Bytes rawFrame(std::string_view payload, std::uint32_t kind = 1, std::uint64
 // Builds a request dictionary from key/value pairs; the daemon's no-op
 // request at a version; a reply's "errorcode" and "error".
 qm::Value request(std::initializer_list<qm::Dictionary::Entry> entries);
-qm::Value bulk(std::uint64_t version = 3);
+qm::Value bulk(std::uint64_t version = wire::kCurrentVersion);
 std::optional<std::uint64_t> errorCode(const qm::Value& reply);
 std::string errorText(const qm::Value& reply);
 
